@@ -1,0 +1,62 @@
+/* Key-management module: keeps the device's store key sealed in EEPROM under
+ * a one-off key that the TPM seals, and proves at boot that the key material
+ * is intact. C interface for host programs. */
+#ifndef KMM_KMM_H
+#define KMM_KMM_H
+
+#include <stdint.h>
+
+#include <kmm/dtc.h>
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+#define KMM_OPTION_NORMAL_BOOT 1
+#define KMM_OPTION_REGENERATE 3
+
+/* The seed key: local date text, calendar time, eight random words. */
+typedef struct KmmSeedKey {
+  char seedDate[8];       /* "%04d%02d%02d", no terminator */
+  uint8_t seedTime[4];    /* seconds, native byte order */
+  uint8_t seedRandom[32]; /* eight results of random(), native byte order */
+} KmmSeedKey;
+
+/* KeyContext holds all key material of the module. There is one static
+ * instance; KeyManage zeroes it on every call. */
+typedef struct KeyContext {
+  uint8_t oneOffKey[32];
+  KmmSeedKey seedKey;
+  uint8_t secretKeyBytes[48];
+  uint8_t storeKeyBytes[48];
+  uint8_t reserved[476];
+  uint16_t statusWord;
+  ProtectedKey* oneOffKeyRef;
+  uint32_t oneOffKeyRefLength;
+  ProtectedKey seedKeyPK;
+  uint32_t seedKeyLength;
+  ProtectedKey secretKeyPK;
+  uint32_t secretKeyLength;
+  ProtectedKey storeKeyPK;
+  uint32_t storeKeyLength;
+  ProtectedKey* cipherParamRef;
+  uint32_t cipherParamLength;
+} KeyContext;
+
+/* KeyManage zeroes the module's context and runs |option|:
+ * KMM_OPTION_NORMAL_BOOT proves the key material (recording DT=OK/DT=FAIL in
+ * the boot status log when |logFlag| is non-zero), KMM_OPTION_REGENERATE
+ * replaces it. Returns the context on success and NULL on failure or for any
+ * other option. The contents are valid until the next call; the module is
+ * not reentrant. */
+KeyContext* KeyManage(int32_t option, int logFlag);
+
+/* CheckDmsetupDigest compares the SHA-256 of the disk-mapper tool with the
+ * built-in expected digest. Returns 0 on a match, -1 otherwise. */
+int CheckDmsetupDigest(void);
+
+#ifdef __cplusplus
+}
+#endif
+
+#endif /* KMM_KMM_H */

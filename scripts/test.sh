@@ -1,0 +1,24 @@
+#!/usr/bin/env bash
+# Builds keymgr with its tests in a sandbox root and runs the whole suite.
+#   scripts/test.sh              normal build in build/, root /tmp/keymgr-test
+#   scripts/test.sh --sanitize   AddressSanitizer + UBSan build in build-asan/,
+#                                root /tmp/keymgr-asan
+set -euo pipefail
+cd "$(dirname "$0")/.."
+bash scripts/install-deps.sh
+
+build=build
+root=/tmp/keymgr-test
+extra=()
+if [ "${1:-}" = "--sanitize" ]; then
+  build=build-asan
+  root=/tmp/keymgr-asan
+  extra=(-DKEYMGR_SANITIZE=ON -DCMAKE_BUILD_TYPE=Debug)
+  export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1:strict_string_checks=1
+  export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
+fi
+
+cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" "${extra[@]}"
+cmake --build "$build" -j "$(nproc)"
+cd "$build"
+ctest --output-on-failure -j "$(nproc)"

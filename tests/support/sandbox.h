@@ -1,0 +1,47 @@
+// Helpers shared by the tests: the sandbox root, files, EEPROM images and
+// running the built programs.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace keymgr::test {
+
+inline constexpr std::size_t kEepromSize = 32768;
+inline constexpr std::uint32_t kControlByteOffset = 5049;
+inline constexpr std::uint32_t kSfeConfOffset = 4958;
+
+// Root is the build's KEYMGR_ROOT; InRoot(p) is Root() + p.
+std::string Root();
+std::string InRoot(std::string_view path);
+
+// ResetSandbox removes everything under the root except "run" (the swtpm of
+// the suite) and creates /quorvan/hidden and /quorvan/spool/log again.
+void ResetSandbox();
+
+void WriteFile(const std::string& path, std::string_view bytes);
+std::optional<std::string> ReadFile(const std::string& path);
+bool Exists(const std::string& path);
+
+// MakeEeprom writes a blank (0xFF) 32 KiB image at KEYMGR_EEPROM_PATH with the
+// given control byte and SFE CONF word (least significant byte first).
+void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf);
+std::vector<std::uint8_t> ReadEepromBytes(std::uint32_t offset, std::uint32_t length);
+void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& bytes);
+
+struct RunResult {
+  int status = -1;  // exit status, or -1 when the program did not exit normally
+  std::string out;
+  std::string err;
+};
+
+// Run starts argv[0] with the arguments in |cwd| (when given) and waits.
+RunResult Run(const std::vector<std::string>& argv, const std::string& cwd = "");
+
+// Hex renders bytes as upper-case "%02X " groups, the way the programs print.
+std::string Hex(std::string_view bytes);
+
+}  // namespace keymgr::test

@@ -1,0 +1,56 @@
+#include "util/bytes.h"
+
+#include <openssl/md5.h>
+
+#include <cstring>
+
+#include "util/debug_print.h"
+
+void PrintHexDump(const std::uint8_t* bytes, std::uint32_t length, int grouped) {
+  for (std::uint32_t i = 0; i < length; ++i) {
+    DebugPrint("%02X ", bytes[i]);
+    if (grouped != 0 && i % 16 == 7) {
+      DebugPrint("  ");
+    }
+    if (grouped != 0 && i % 16 == 15) {
+      DebugPrint("\n");
+    }
+  }
+  DebugPrint("\n");
+}
+
+void PrintArray(const std::uint8_t* bytes, std::int32_t size) {
+  DebugPrint("print_array: size[%d] ", size);
+  for (std::int32_t i = 0; i < size; ++i) {
+    DebugPrint("%02X ", bytes[i]);
+  }
+  DebugPrint(" \n");
+}
+
+int Md5OfString(const char* text, std::uint8_t* digest) {
+  MD5_CTX ctx;
+  MD5_Init(&ctx);
+  MD5_Update(&ctx, text, std::strlen(text));
+  MD5_Final(digest, &ctx);
+  return 0;
+}
+
+int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize) {
+  static constexpr char kDigits[] = "0123456789ABCDEF";
+  if (src == nullptr || length == 0 || dst == nullptr || dstSize == 0) {
+    DebugPrint("ERR: Null pointer detecter or zero length\n");
+    return -1;
+  }
+  // In int arithmetic: 2 * 255 + 1 does not fit the 8-bit capacity, so a
+  // length of 128 or more can never pass.
+  if (static_cast<int>(dstSize) < 2 * static_cast<int>(length) + 1) {
+    DebugPrint("ERR: to short destination buffer");
+    return -1;
+  }
+  for (int i = 0; i < length; ++i) {
+    dst[2 * i] = kDigits[src[i] >> 4];
+    dst[2 * i + 1] = kDigits[src[i] & 0x0F];
+  }
+  dst[2 * length] = '\0';
+  return 0;
+}

@@ -1,0 +1,22 @@
+// Byte printing and hexadecimal helpers. All output goes through DebugPrint.
+#pragma once
+
+#include <cstdint>
+
+// PrintHexDump prints |length| bytes as "%02X ", with a two-blank gap after
+// the 8th and a line feed after the 16th byte of each row when |grouped| is
+// non-zero, and always a final line feed.
+void PrintHexDump(const std::uint8_t* bytes, std::uint32_t length, int grouped);
+
+// PrintArray prints "print_array: size[N] ", the bytes as "%02X ", then " \n".
+// A size of 0 or less prints no bytes.
+void PrintArray(const std::uint8_t* bytes, std::int32_t size);
+
+// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
+// bytes at |digest|. Always returns 0.
+int Md5OfString(const char* text, std::uint8_t* digest);
+
+// BytesToHex writes the upper-case hex text of |length| bytes of |src| and a
+// NUL into |dst|, which holds |dstSize| bytes. Returns 0, or -1 with a message
+// and |dst| untouched on a null pointer, a zero size or a short |dst|.
+int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize);

@@ -1,0 +1,86 @@
+#include "util/file_digest.h"
+
+#include <fcntl.h>
+#include <openssl/sha.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <limits>
+
+#include "util/secure.h"
+
+namespace keymgr {
+
+namespace {
+
+// OpenRegular opens |path| without blocking and only when it is a regular
+// file: a FIFO with no writer would otherwise block the boot run for ever,
+// and devices or directories have no meaningful contents to hash.
+File OpenRegular(const char* path, const char* mode) {
+  int fd = ::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) {
+    return nullptr;
+  }
+  struct stat st;
+  if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    int saved = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+    ::close(fd);
+    errno = saved;
+    return nullptr;
+  }
+  std::FILE* f = ::fdopen(fd, mode);
+  if (f == nullptr) {
+    int saved = errno;
+    ::close(fd);
+    errno = saved;
+  }
+  return File(f);
+}
+
+}  // namespace
+
+FileDigestResult ComputeFileDigest(const char* path, const char* mode,
+                                   std::span<std::uint8_t, kFileDigestSize> digest) {
+  struct stat st;
+  if (::stat(path, &st) < 0) {
+    return FileDigestResult::kStatusFailure;
+  }
+  // The size is a signed 32-bit count; a file of 2 GiB or more cannot be
+  // held, so it fails like an unopenable one rather than wrapping.
+  if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max() - 1) {
+    errno = EFBIG;
+    return FileDigestResult::kOpenFailure;
+  }
+  const auto size = static_cast<std::int32_t>(st.st_size);
+
+  File file = OpenRegular(path, mode);
+  if (!file) {
+    return FileDigestResult::kOpenFailure;
+  }
+  auto* buffer = static_cast<std::uint8_t*>(std::calloc(static_cast<std::size_t>(size) + 1, 1));
+  if (buffer == nullptr) {
+    errno = ENOMEM;
+    return FileDigestResult::kOpenFailure;
+  }
+  ScopeExit release([&] { std::free(buffer); });
+  // A short read leaves zeros in place of the missing bytes.
+  std::size_t got = std::fread(buffer, 1, static_cast<std::size_t>(size), file.get());
+  (void)got;
+  file.reset();
+
+  SHA256_CTX ctx;
+  std::memset(&ctx, 0, sizeof(ctx));
+  std::uint8_t out[kFileDigestSize] = {};
+  SHA256_Init(&ctx);
+  SHA256_Update(&ctx, buffer, static_cast<std::size_t>(size));
+  SHA256_Final(out, &ctx);
+  std::memcpy(digest.data(), out, kFileDigestSize);
+  return FileDigestResult::kOk;
+}
+
+}  // namespace keymgr
