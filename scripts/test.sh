@@ -2,17 +2,18 @@
 # Builds keymgr with its tests in a sandbox root and runs the whole suite.
 #   scripts/test.sh              normal build in build/, root /tmp/keymgr-test
 #   scripts/test.sh --sanitize   AddressSanitizer + UBSan build in build-asan/,
-#                                root /tmp/keymgr-asan
+#                                root /tmp/keymgr-test-asan
+# KEYMGR_TEST_ROOT overrides the sandbox root (at most 35 characters).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 
 build=build
-root=/tmp/keymgr-test
+root=${KEYMGR_TEST_ROOT:-/tmp/keymgr-test}
 extra=()
 if [ "${1:-}" = "--sanitize" ]; then
   build=build-asan
-  root=/tmp/keymgr-asan
+  root=${KEYMGR_TEST_ROOT:-/tmp/keymgr-test}-asan
   extra=(-DKEYMGR_SANITIZE=ON -DCMAKE_BUILD_TYPE=Debug)
   export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1:strict_string_checks=1
   export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
