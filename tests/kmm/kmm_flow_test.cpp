@@ -204,6 +204,8 @@ TEST_F(KmmTest, StoreKeyReadHasThreeAttempts) {
     return [=] { fake::InjectEepromError(EepromOp::kRead, 4244, 4292, n); };
   };
   const std::string kValues = "Read Store Key but values are error [Retry:";
+  const std::string kReadError =
+      "Read Error [-5] - Store Key from EEPROM !!!\nRead Store Key error [Retry:";
   struct Case {
     std::function<void()> arm;
     int logFlag;
@@ -211,12 +213,9 @@ TEST_F(KmmTest, StoreKeyReadHasThreeAttempts) {
     bool whole;
     const char* log;
   } cases[] = {
-      {failReads(1), 1, kStart + "Read Store Key error [Retry:2]!!!\nSuccessed to open", false,
-       "DT=OK\n"},
+      {failReads(1), 1, kStart + kReadError + "2]!!!\nSuccessed to open", false, "DT=OK\n"},
       {failReads(3), 1,
-       kStart +
-           "Read Store Key error [Retry:2]!!!\nRead Store Key error [Retry:1]!!!\n"
-           "Read Store Key error [Retry:0]!!!\n" +
+       kStart + kReadError + "2]!!!\n" + kReadError + "1]!!!\n" + kReadError + "0]!!!\n" +
            kFailTail,
        true, "DT=FAIL\n"},
       {blank(0xFF, 0xFF), 1,
