@@ -129,14 +129,6 @@ TEST_F(KmmTest, StorageUsesItsRegionsAndReportsFaults) {
   EXPECT_EQ(length, 99u);
   EXPECT_EQ(dst, Bytes(48, 0xAB));
 
-  // An empty disk copy reads as the caller's zeros.
-  WriteFile(kScDigestPath, "");
-  digest.assign(32, 0);
-  EXPECT_EQ(Output([&] { EXPECT_EQ(ReadDigestHDD(digest.data()), 0); }), "");
-  EXPECT_EQ(digest, Bytes(32, 0));
-  fs::remove_all(InRoot("/quorvan/hidden"));
-  EXPECT_EQ(Output([&] { EXPECT_EQ(WriteDigestHDD(digest.data()), 1); }),
-            std::string(kScDigestPath) + " open error!!!\n");
 }
 
 TEST_F(KmmTest, RegenerationStoresKeyMaterialThatNormalBootProves) {
