@@ -128,7 +128,6 @@ TEST_F(KmmTest, StorageUsesItsRegionsAndReportsFaults) {
                      kScDigestPath + " open error!!!\n");
   EXPECT_EQ(length, 99u);
   EXPECT_EQ(dst, Bytes(48, 0xAB));
-
 }
 
 TEST_F(KmmTest, RegenerationStoresKeyMaterialThatNormalBootProves) {
