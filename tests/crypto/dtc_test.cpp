@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 #include <kmm/dtc.h>
 
+#include <algorithm>
 #include <array>
 #include <cstdint>
 #include <cstdio>
@@ -31,7 +32,7 @@ struct Slot {
   std::array<std::uint8_t, 64> bytes{};
   ProtectedKey pk{};
   explicit Slot(const Bytes& plain = {}) {
-    std::memcpy(bytes.data(), plain.data(), plain.size());
+    std::copy(plain.begin(), plain.end(), bytes.begin());
     ProtectedKey_Attach(&pk, 0, bytes.data());
   }
 };
