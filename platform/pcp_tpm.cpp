@@ -73,6 +73,9 @@ void QuietTssLog() {
 // Tpm holds one call's contexts and objects and releases them on every path:
 // transient objects and sessions are flushed, the persistent key's auth value
 // is overwritten and its handle closed, then ESAPI and the TCTI are finalised.
+// After a transport error ESAPI refuses further commands and the flushes fail;
+// the device's kernel resource manager (/dev/tpmrm0) then drops what the
+// connection held when it closes.
 struct Tpm {
   TSS2_TCTI_CONTEXT* tcti = nullptr;
   ESYS_CONTEXT* ctx = nullptr;
