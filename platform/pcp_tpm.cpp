@@ -24,6 +24,8 @@ using keymgr::ScopeExit;
 using keymgr::Secret;
 
 constexpr uint32_t kDigestSize = 16;
+// Largest single draw; the callers ask for 20 or 32 bytes.
+constexpr uint32_t kMaxRandom = 1024;
 
 // Sealed fragment, PCP_FRAGMENT_SIZE bytes, integers big-endian:
 //   0..3   tag "PCPF"
@@ -208,11 +210,14 @@ TPMT_RSA_DECRYPT OaepSha256() {
 
 }  // namespace
 
+// Draws land in a wiped staging buffer and reach |dst| only when all |count|
+// bytes are in, so that a failed call leaves |dst| as it was.
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
   if (count == 0) {
     return 0;
   }
-  if (dst == nullptr) {
+  Secret<kMaxRandom> drawn;
+  if (dst == nullptr || count > drawn.size()) {
     return 1;
   }
   // The draws become keys and passwords: the response is encrypted.
@@ -223,20 +228,21 @@ int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
   uint32_t filled = 0;
   while (filled < count) {
     uint16_t want = static_cast<uint16_t>(std::min<uint32_t>(count - filled, sizeof(TPMU_HA)));
-    TPM2B_DIGEST* drawn = nullptr;
-    if (Esys_GetRandom(tpm.ctx, tpm.session, ESYS_TR_NONE, ESYS_TR_NONE, want, &drawn) !=
+    TPM2B_DIGEST* part = nullptr;
+    if (Esys_GetRandom(tpm.ctx, tpm.session, ESYS_TR_NONE, ESYS_TR_NONE, want, &part) !=
         TSS2_RC_SUCCESS) {
       return 1;
     }
-    uint32_t take = std::min<uint32_t>({drawn->size, want, sizeof(drawn->buffer)});
-    std::memcpy(dst + filled, drawn->buffer, take);
-    OPENSSL_cleanse(drawn, sizeof(*drawn));
-    Esys_Free(drawn);
+    uint32_t take = std::min<uint32_t>({part->size, want, sizeof(part->buffer)});
+    std::memcpy(drawn.data() + filled, part->buffer, take);
+    OPENSSL_cleanse(part, sizeof(*part));
+    Esys_Free(part);
     if (take == 0) {
       return 1;
     }
     filled += take;
   }
+  std::memcpy(dst, drawn.data(), count);
   return 0;
 }
 

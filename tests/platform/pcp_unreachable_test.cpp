@@ -21,7 +21,9 @@ TEST(PcpUnreachable, EveryCallFailsQuietly) {
   const char* hex = "00112233445566778899AABBCCDDEEFF00112233";
   uint32_t size = PCP_FRAGMENT_SIZE;
   testing::internal::CaptureStderr();
+  buf.fill(0xA5);
   EXPECT_NE(pcp_getRandomBytes(32, buf.data()), 0);
+  EXPECT_EQ(buf[0], 0xA5) << "a failed draw leaves the buffer as it was";
   EXPECT_NE(pcp_create_key(digest.data(), digest.data(), 2048, 0), 0);
   EXPECT_NE(pcp_delete_key(digest.data(), 0), 0);
   EXPECT_NE(pcp_encryptDataFragment(hex, hex, buf.data(), 32, buf.data(), &size), 0);
