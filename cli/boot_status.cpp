@@ -1,6 +1,74 @@
 #include "cli/boot_status.h"
 
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+
+#include "platform/eeprom.h"
+#include "util/debug_print.h"
+#include "util/paths.h"
+#include "util/secure.h"
+
+namespace {
+
+// The security-feature configuration word: 4 bytes, least significant first.
+constexpr std::uint32_t kSfeConfOffset = 4958;
+constexpr std::uint32_t kSfeConfLength = 4;
+constexpr std::uint32_t kSfe003Mask = 0x4;
+
+struct StatusLine {
+  const char* text;
+  std::size_t length;
+};
+
+// One line per status code, written without a terminator.
+constexpr StatusLine kStatusLines[] = {
+    {"BN=OK\n", 6},   {"BN=FAIL\n", 8}, {"DT=OK\n", 6},
+    {"DT=FAIL\n", 8}, {"ST=OK\n", 6},   {"ST=FAIL\n", 8},
+};
+constexpr unsigned int kLastStatusCode = 5;
+static_assert(std::size(kStatusLines) == kLastStatusCode + 1);
+
+static_assert(sizeof(keymgr::kBootLogPath) <= keymgr::kPathBufferSize);
+
+}  // namespace
+
 unsigned int CheckSecurityFeature() {
-  return 0;
+  std::uint8_t bytes[kSfeConfLength] = {};
+  int result = ReadEEPROM_msok(0, kSfeConfOffset, kSfeConfLength, bytes);
+  if (result < 0) {
+    DebugPrint("Read Error [%d] - SFE CONF from EEPROM !!!\n", result);
+    return 0;
+  }
+  // Assembled byte by byte so the word reads the same on any host.
+  std::uint32_t word = 0;
+  for (std::uint32_t i = 0; i < kSfeConfLength; ++i) {
+    word |= static_cast<std::uint32_t>(bytes[i]) << (8 * i);
+  }
+  DebugPrint("SFE_003 - [%x]\n", word & kSfe003Mask);
+  return (word & kSfe003Mask) != 0 ? 1 : 0;
 }
-void WriteBootStatus(unsigned int) {}
+
+void WriteBootStatus(unsigned int code) {
+  // Only the manifest verification issues the BN codes, and it already runs
+  // behind the EEPROM gate; every later line needs SFE_003 on.
+  const bool startsLog = code == kBootStatusBnOk || code == kBootStatusBnFail;
+  if (!startsLog && CheckSecurityFeature() != 1) {
+    return;
+  }
+  char path[keymgr::kPathBufferSize] = {};
+  std::memcpy(path, keymgr::kBootLogPath, sizeof(keymgr::kBootLogPath));
+
+  keymgr::File log = keymgr::OpenFile(path, startsLog ? "w" : "a+");
+  if (!log) {
+    DebugPrint("file[%s] open error!!\n", path);
+    return;
+  }
+  if (code <= kLastStatusCode) {
+    const StatusLine& line = kStatusLines[code];
+    DebugPrint("%s", line.text);
+    (void)std::fwrite(line.text, 1, line.length, log.get());
+  } else {
+    DebugPrint("Unknown flag!!\n");
+  }
+}

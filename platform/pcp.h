@@ -12,7 +12,8 @@ extern "C" {
 // Size of a sealed fragment: 12-byte header and 256-byte RSA-OAEP ciphertext.
 #define PCP_FRAGMENT_SIZE 268u
 
-// pcp_getRandomBytes fills |count| bytes of |dst| from the TPM's generator.
+// pcp_getRandomBytes fills |count| bytes of |dst| from the TPM's generator;
+// on failure |dst| is left as it was.
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst);
 
 // pcp_create_key creates an RSA-|bits| decryption key authorised by the 16

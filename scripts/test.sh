@@ -19,7 +19,12 @@ if [ "${1:-}" = "--sanitize" ]; then
   export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
 fi
 
-cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" "${extra[@]}"
+# The suite installs tests/kmm/data/dmsetup as the disk-mapper tool, so the
+# build expects that file's digest.
+dmsetup_sha256=$(sha256sum tests/kmm/data/dmsetup | cut -d" " -f1)
+
+cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" -DKEYMGR_DMSETUP_SHA256="$dmsetup_sha256" \
+  "${extra[@]}"
 cmake --build "$build" -j "$(nproc)"
 cd "$build"
 ctest --output-on-failure -j "$(nproc)"

@@ -26,7 +26,7 @@ File OpenRegular(const char* path, const char* mode) {
   if (fd < 0) {
     return nullptr;
   }
-  struct stat st;
+  struct stat st {};
   if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
     int saved = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
     ::close(fd);
@@ -52,7 +52,7 @@ FileDigestResult ComputeFileDigest(const char* path, const char* mode,
   }
   // The size is a signed 32-bit count; a file of 2 GiB or more cannot be
   // held, so it fails like an unopenable one rather than wrapping.
-  if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max() - 1) {
+  if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max()) {
     errno = EFBIG;
     return FileDigestResult::kOpenFailure;
   }
