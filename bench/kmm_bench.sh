@@ -1,13 +1,13 @@
 #!/usr/bin/env bash
 # Median wall time of a regeneration (kmm-host 3) and of a boot proof
 # (kmm-host 1 1) on the build's sandbox root and a fresh swtpm.
-#   bench/kmm_bench.sh [BUILD_DIR]     (default: build; RUNS=7)
+#   bench/kmm_bench.sh [BUILD_DIR] [N]     (defaults: build, 7)
 # Do not run it while that build's test suite runs: both use the same swtpm
 # socket and sandbox root.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 build=${1:-build}
-runs=${RUNS:-7}
+runs=${2:-7}
 cache=$build/CMakeCache.txt
 [ -f "$cache" ] || { echo "no $cache: configure and build first" >&2; exit 1; }
 setting() { sed -n "s/^$1:[A-Z]*=//p" "$cache"; }
