@@ -167,6 +167,7 @@ TEST_F(KmmTest, RegenerationStoresKeyMaterialThatNormalBootProves) {
                 "SFE_003 - [4]\nDT=OK\n" +
                 kEnd);
   EXPECT_EQ(booted, context);
+  EXPECT_EQ(fake::PcpCalls().back().length, 268u);  // the fragment, not the whole file
   EXPECT_EQ(context->secretKeyLength, 48u);
   EXPECT_EQ(KeyBytes(&context->secretKeyPK, 48), [&] {
     secret.resize(48);  // the 16 bytes sealed after the secret key are zero
