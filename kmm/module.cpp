@@ -1,3 +1,58 @@
-#include <kmm/kmm.h>
+// The module entry and its one key context.
+#include <cstddef>
+#include <cstring>
 
-KeyContext* KeyManage(int32_t, int) { return nullptr; }
+#include "kmm/internal.h"
+#include "util/debug_print.h"
+
+using namespace keymgr::kmm;
+
+// Hosts read the context by field, so its layout up to the status word is
+// fixed; the records after it follow in declaration order.
+static_assert(sizeof(KmmSeedKey) == kSeedKeySize);
+static_assert(offsetof(KmmSeedKey, seedTime) == 8 && offsetof(KmmSeedKey, seedRandom) == 12);
+static_assert(offsetof(KeyContext, oneOffKey) == 0);
+static_assert(sizeof(KeyContext::oneOffKey) == kOneOffKeySize);
+static_assert(offsetof(KeyContext, seedKey) == 32);
+static_assert(offsetof(KeyContext, secretKeyBytes) == 76);
+static_assert(sizeof(KeyContext::secretKeyBytes) == kSealedKeySize);
+static_assert(offsetof(KeyContext, storeKeyBytes) == 124);
+static_assert(sizeof(KeyContext::storeKeyBytes) == kSealedKeySize);
+static_assert(offsetof(KeyContext, reserved) == 172 && sizeof(KeyContext::reserved) == 476);
+static_assert(offsetof(KeyContext, statusWord) == 648 && sizeof(KeyContext::statusWord) == 2);
+static_assert(offsetof(KeyContext, statusWord) < offsetof(KeyContext, oneOffKeyRef) &&
+              offsetof(KeyContext, oneOffKeyRef) < offsetof(KeyContext, oneOffKeyRefLength) &&
+              offsetof(KeyContext, oneOffKeyRefLength) < offsetof(KeyContext, seedKeyPK) &&
+              offsetof(KeyContext, seedKeyPK) < offsetof(KeyContext, seedKeyLength) &&
+              offsetof(KeyContext, seedKeyLength) < offsetof(KeyContext, secretKeyPK) &&
+              offsetof(KeyContext, secretKeyPK) < offsetof(KeyContext, secretKeyLength) &&
+              offsetof(KeyContext, secretKeyLength) < offsetof(KeyContext, storeKeyPK) &&
+              offsetof(KeyContext, storeKeyPK) < offsetof(KeyContext, storeKeyLength) &&
+              offsetof(KeyContext, storeKeyLength) < offsetof(KeyContext, cipherParamRef) &&
+              offsetof(KeyContext, cipherParamRef) < offsetof(KeyContext, cipherParamLength));
+
+namespace {
+// The module's one context. Its address is what a successful entry returns.
+KeyContext g_keyContext;
+}  // namespace
+
+extern "C" KeyContext* KeyManage(int32_t option, int logFlag) {
+  // Every entry starts from nothing, even one that is then rejected.
+  std::memset(&g_keyContext, 0, sizeof(g_keyContext));
+  if (option == KMM_OPTION_NORMAL_BOOT) {
+    if (NormalBoot(&g_keyContext, logFlag) != 0) {
+      DebugPrint("Normal Boot Error!!\n");
+      return nullptr;
+    }
+  } else if (option == KMM_OPTION_REGENERATE) {
+    int failed = RegenerateKey(&g_keyContext) != 0 ? 1 : 0;
+    if (failed == 1) {
+      DebugPrint("Regenerate Key Error!!\n");
+      return nullptr;
+    }
+  } else {
+    DebugPrint("Key manage option invalid(%d)!!\n", option);
+    return nullptr;
+  }
+  return &g_keyContext;
+}

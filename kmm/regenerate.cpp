@@ -1,0 +1,106 @@
+// Regeneration of all key material: seed key, secret key, SC digest, store key.
+#include <array>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+
+#include "kmm/internal.h"
+#include "util/debug_print.h"
+#include "util/secure.h"
+
+using namespace keymgr::kmm;
+
+int RegenerateKey(KeyContext* context) {
+  if (GenerateSeedKey(context) != 0) {
+    DebugPrint("Generate Seed Key Error!!!\n");
+    return 1;
+  }
+  if (GenerateSecretKey(context) != 0) {
+    DebugPrint("Generate Secret Key Error!!!\n");
+    return 1;
+  }
+  // The digest is stored before the store key is sealed and written: a later
+  // failure leaves the new digest beside the old store key, and the next boot
+  // reports the mismatch until a regeneration succeeds.
+  std::array<std::uint8_t, kDigestSize> digest{};
+  if (GenerateMessageDigest(kDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
+    DebugPrint("Generate Message Digest Error!!!\n");
+    return 1;
+  }
+  if (GenerateStoreKey(context) != 0) {
+    DebugPrint("Generate Store Key Error!!!\n");
+    return 1;
+  }
+  std::array<std::uint8_t, kSealedKeySize> storeKey{};
+  for (std::uint32_t i = 0; i < kSealedKeySize; ++i) {
+    storeKey[i] = ProtectedKey_ByteAt(&context->storeKeyPK, i);
+  }
+  if (WriteStoreKey(kSealedKeySize, storeKey.data()) != 0) {
+    DebugPrint("Write Store Key Error!!!\n");
+    return 1;
+  }
+  return 0;
+}
+
+int GenerateSeedKey(KeyContext* context) {
+  std::array<char, 12> date{};
+  keymgr::Secret<sizeof(KmmSeedKey::seedRandom)> random;
+
+  std::time_t now = std::time(nullptr);
+  std::tm local{};
+  // Without a local time the date part stays zero; the random part still
+  // makes the seed.
+  if (localtime_r(&now, &local) != nullptr) {
+    int written = std::snprintf(date.data(), date.size(), "%04d%02d%02d", local.tm_year + 1900,
+                                local.tm_mon + 1, local.tm_mday);
+    if (written < 0 || static_cast<std::size_t>(written) >= date.size()) {
+      date.fill('\0');
+    }
+  }
+  for (std::size_t k = 0; k < random.size() / 4; ++k) {
+    auto word = static_cast<std::uint32_t>(::random());
+    std::memcpy(random.data() + 4 * k, &word, sizeof(word));
+  }
+  auto seconds = static_cast<std::uint32_t>(std::time(nullptr));
+
+  KmmSeedKey& seed = context->seedKey;
+  std::memcpy(seed.seedDate, date.data(), sizeof(seed.seedDate));
+  std::memcpy(seed.seedTime, &seconds, sizeof(seed.seedTime));
+  std::memcpy(seed.seedRandom, random.data(), sizeof(seed.seedRandom));
+
+  context->seedKeyLength = kSeedKeySize;
+  ProtectedKey_Attach(&context->seedKeyPK, 0, reinterpret_cast<std::uint8_t*>(&context->seedKey));
+  ProtectedKey_SetLength(&context->seedKeyPK, context->seedKeyLength);
+  DebugPrint("Seed Key is created!!\n");
+  return 0;
+}
+
+int GenerateSecretKey(KeyContext* context) {
+  std::uint32_t result = 0;
+  context->secretKeyLength = kSecretKeySize;  // capacity going in
+  ProtectedKey_Attach(&context->secretKeyPK, 0, context->secretKeyBytes);
+
+  ContainerScope container(VKT_DTC_CreateCryptoContainer());
+  if (container.get() == nullptr) {
+    // Creation reports no code; the line shows the result so far, 0.
+    DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, &context->seedKeyPK, kSeedKeySize,
+                           &context->secretKeyPK, &context->secretKeyLength);
+  if (result != 0) {
+    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  if (context->secretKeyLength != kSecretKeySize) {
+    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+    return 1;
+  }
+  // The sealing later in this regeneration uses this reference as it is.
+  VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
+  container.Destroy();
+  DebugPrint("Secret Key is created!!\n");
+  return 0;
+}

@@ -1,0 +1,81 @@
+// Where the module keeps its state: the store key and the SC digest in
+// EEPROM, and the disk copy of the digest in "keymgr.cs".
+#include <array>
+#include <cstring>
+
+#include "kmm/internal.h"
+#include "platform/eeprom.h"
+#include "util/debug_print.h"
+#include "util/paths.h"
+#include "util/secure.h"
+
+using namespace keymgr::kmm;
+
+namespace {
+// The first argument of every EEPROM call: the device's EEPROM.
+constexpr int kEepromDevice = 0;
+}  // namespace
+
+int ReadStoreKey(std::uint32_t* length, std::uint8_t* dst) {
+  if (dst == nullptr) {
+    DebugPrint("Read Error [NULL] - Store Key from EEPROM !!!\n");
+    return 1;
+  }
+  std::array<std::uint8_t, kSealedKeySize> buffer{};
+  int result = ReadEEPROM_msok(kEepromDevice, kStoreKeyOffset, kSealedKeySize, buffer.data());
+  if (result < 0) {
+    DebugPrint("Read Error [%d] - Store Key from EEPROM !!!\n", result);
+    return 1;
+  }
+  *length = kSealedKeySize;
+  std::memcpy(dst, buffer.data(), buffer.size());
+  return 0;
+}
+
+int WriteStoreKey(std::uint32_t /*length*/, const std::uint8_t* src) {
+  if (src == nullptr) {
+    DebugPrint("Write Error [NULL] - Store Key to EEPROM !!!\n");
+    return 1;
+  }
+  // The store key always fills its whole region, whatever length is claimed.
+  std::array<std::uint8_t, kSealedKeySize> buffer{};
+  std::memcpy(buffer.data(), src, buffer.size());
+  int result = WriteSectionEEPROM(kEepromDevice, kStoreKeyOffset, kSealedKeySize, buffer.data(),
+                                  kStoreKeySectionStart, kStoreKeySectionLength);
+  if (result < 0) {
+    DebugPrint("Write Error [%d] - Store Key to EEPROM !!!\n", result);
+    return 1;
+  }
+  return 0;
+}
+
+int ReadDigestEEPROM(std::uint8_t* dst) {
+  if (ReadEEPROM_msok(kEepromDevice, kScDigestOffset, kDigestSize, dst) < 0) {
+    DebugPrint("Read Error - Message Digest from EEPROM !!!\n");
+    return 1;
+  }
+  return 0;
+}
+
+int WriteDigestHDD(const std::uint8_t* digest) {
+  keymgr::File file = keymgr::OpenFile(keymgr::kScDigestPath, "w");
+  if (!file) {
+    DebugPrint("%s open error!!!\n", keymgr::kScDigestPath);
+    return 1;
+  }
+  // A short write shows up at the next boot as a digest mismatch.
+  std::fwrite(digest, 1, kDigestSize, file.get());
+  return 0;
+}
+
+int ReadDigestHDD(std::uint8_t* dst) {
+  keymgr::File file = keymgr::OpenFile(keymgr::kScDigestPath, "r");
+  if (!file) {
+    DebugPrint("%s open error!!!\n", keymgr::kScDigestPath);
+    return 1;
+  }
+  // A short file leaves the caller's zeros, which then fail the comparison.
+  std::size_t got = std::fread(dst, 1, kDigestSize, file.get());
+  (void)got;
+  return 0;
+}

@@ -1,0 +1,219 @@
+// Sealing and unsealing of the store key. The store key is the secret-key area
+// enciphered under a one-off key (OOK); the OOK is sealed by the TPM under a
+// key with a random identity and password, kept in three files.
+#include <array>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+
+#include "kmm/internal.h"
+#include "platform/pcp.h"
+#include "util/bytes.h"
+#include "util/debug_print.h"
+#include "util/paths.h"
+#include "util/secure.h"
+
+using namespace keymgr::kmm;
+
+namespace {
+
+using keymgr::Secret;
+using keymgr::SecretText;
+
+using TpmSecret = Secret<kTpmSecretSize>;
+using TpmSecretHex = SecretText<kTpmSecretHexSize>;
+
+// HexOf writes the hex text of a TPM identity or password. Both sizes are
+// fixed, so it cannot fail.
+void HexOf(const TpmSecret& bytes, TpmSecretHex& text) {
+  BytesToHex(bytes.data(), kTpmSecretSize, text.data(), kTpmSecretHexSize);
+}
+
+// ReadKeyFile reads up to |size| bytes of |path| into |dst| and returns false
+// when the file cannot be opened. A short file leaves the rest of |dst|.
+bool ReadKeyFile(const char* path, std::uint8_t* dst, std::size_t size) {
+  keymgr::File file = keymgr::OpenFile(path, "r");
+  if (!file) {
+    return false;
+  }
+  std::size_t got = std::fread(dst, 1, size, file.get());
+  (void)got;
+  return true;
+}
+
+// WriteKeyFile replaces |path| with |size| bytes of |src|, reporting the open
+// under the file's short |name|.
+bool WriteKeyFile(const char* path, const char* name, const std::uint8_t* src, std::size_t size) {
+  keymgr::File file = keymgr::OpenFile(path, "w");
+  if (!file) {
+    DebugPrint("Failed to open %s\n", name);
+    return false;
+  }
+  DebugPrint("Successed to open %s\n", name);
+  std::fwrite(src, 1, size, file.get());
+  return true;
+}
+
+// BindOneOffKey copies the OOK into the context and binds the AES key
+// constant to it.
+void BindOneOffKey(KeyContext* context, const Secret<kOneOffKeySize>& ook) {
+  std::memcpy(context->oneOffKey, ook.data(), kOneOffKeySize);
+  ProtectedKey_Attach(context->oneOffKeyRef, 0, context->oneOffKey);
+  ProtectedKey_SetLength(context->oneOffKeyRef, context->oneOffKeyRefLength);
+}
+
+// RunAes runs one AES job over 48 bytes from |in| to |out| under the bound
+// OOK and the AES parameter constant. Returns 0, or 1 with a message.
+int RunAes(KeyContext* context, std::uint32_t direction, const ProtectedKey* in, ProtectedKey* out,
+           std::uint32_t* outLength) {
+  ContainerScope container(VKT_DTC_CreateCryptoContainer());
+  if (container.get() == nullptr) {
+    DebugPrint("VKT_DTC_CreateCryptoContainer Failed.\n");
+    return 1;
+  }
+  if (VKT_DTC_AES_Init(container.get(), direction, DTC_AES_MODE, context->oneOffKeyRef,
+                       context->oneOffKeyRefLength, context->cipherParamRef) != 0) {
+    DebugPrint("VKT_DTC_AES_Init Failed.\n");
+    return 1;
+  }
+  if (VKT_DTC_AES_Process(container.get(), in, kSealedKeySize, out, outLength) != 0) {
+    DebugPrint("VKT_DTC_AES_Process Failed.\n");
+    return 1;
+  }
+  if (*outLength != kSealedKeySize) {
+    DebugPrint("DTC_AES Failed.\n");
+    return 1;
+  }
+  container.Destroy();
+  return 0;
+}
+
+}  // namespace
+
+int GenerateStoreKey(KeyContext* context) {
+  Secret<kOneOffKeySize> ook;
+  ook.bytes = kInitialOneOffKey;
+  TpmSecret identity;
+  TpmSecret password;
+  TpmSecretHex nameHex;
+  TpmSecretHex passHex;
+  Secret<kNameDigestSize> nameDigest;
+  Secret<kNameDigestSize> passDigest;
+  // Cleared so that the bytes past the sealed fragment are defined on disk.
+  std::array<std::uint8_t, kStoredOokSize> storedOok{};
+  std::uint32_t storedOokSize = kStoredOokSize;
+
+  // The previous generation's TPM key goes first; on a first generation
+  // there is none and nothing is said about it.
+  if (ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize)) {
+    HexOf(identity, nameHex);
+    Md5OfString(nameHex.c_str(), nameDigest.data());
+    if (pcp_delete_key(nameDigest.data(), 0) == 0) {
+      DebugPrint("Successed to delete ID/PWD in TPM.\n");
+    } else {
+      DebugPrint("Failed to delete ID/PWD in TPM.\n");
+    }
+  }
+
+  // A failed draw is reported and the buffer keeps what it had.
+  if (pcp_getRandomBytes(kOneOffKeySize, ook.data()) == 0) {
+    DebugPrint("Successed to generate one_off_key by TPM.\n");
+  } else {
+    DebugPrint("Failed to generate one_off_key by TPM.\n");
+  }
+  if (pcp_getRandomBytes(kTpmSecretSize, identity.data()) == 0) {
+    DebugPrint("Successed to generate user_name_hex.\n");
+  } else {
+    DebugPrint("Failed to generate user_name_hex.\n");
+  }
+  HexOf(identity, nameHex);
+  Md5OfString(nameHex.c_str(), nameDigest.data());
+  if (pcp_getRandomBytes(kTpmSecretSize, password.data()) == 0) {
+    DebugPrint("Successed to generate user_pass_hex.\n");
+  } else {
+    DebugPrint("Failed to generate user_pass_hex.\n");
+  }
+  HexOf(password, passHex);
+  Md5OfString(passHex.c_str(), passDigest.data());
+
+  // The TPM key lives under the MD5 digests of the hex texts; the fragment
+  // is sealed under the texts themselves.
+  if (pcp_create_key(nameDigest.data(), passDigest.data(), kTpmKeyBits, 0) != 0) {
+    DebugPrint("Failed to create OOK.\n");
+    return 1;
+  }
+  DebugPrint("Successed to create OOK.\n");
+  if (pcp_encryptDataFragment(nameHex.c_str(), passHex.c_str(), ook.data(), kOneOffKeySize,
+                              storedOok.data(), &storedOokSize) != 0) {
+    DebugPrint("Failed to encrypt Stored-OOK.\n");
+    return 1;
+  }
+  DebugPrint("Successed to encrypt Stored-OOK.\n");
+
+  // Fixed order, written in place: a failure leaves a mixed generation.
+  if (!WriteKeyFile(keymgr::kKeyIdPath, "keymgr.hddkeyid", identity.data(), kTpmSecretSize) ||
+      !WriteKeyFile(keymgr::kKeyPwdPath, "keymgr.hddpwd", password.data(), kTpmSecretSize) ||
+      !WriteKeyFile(keymgr::kStoredOokPath, "keymgr.ook", storedOok.data(), storedOok.size())) {
+    return 1;
+  }
+
+  VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
+  BindOneOffKey(context, ook);
+  ProtectedKey_Attach(&context->storeKeyPK, 0, context->storeKeyBytes);
+  // All 48 bytes of the secret-key area are sealed: the secret key and the
+  // 16 bytes after it.
+  if (RunAes(context, DTC_AES_ENCRYPT, &context->secretKeyPK, &context->storeKeyPK,
+             &context->storeKeyLength) != 0) {
+    return 1;
+  }
+  DebugPrint("ST Key is encrypted!!\n");
+  return 0;
+}
+
+int DecryptStoreKey(KeyContext* context) {
+  TpmSecret identity;
+  TpmSecret password;
+  TpmSecretHex nameHex;
+  TpmSecretHex passHex;
+  Secret<kOneOffKeySize> ook;
+  ook.bytes = kInitialOneOffKey;
+  std::uint32_t ookSize = kOneOffKeySize;
+  // Cleared so that a short file leaves defined bytes behind what it held.
+  std::array<std::uint8_t, kStoredOokSize> storedOok{};
+
+  VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
+  // Without the identity file the OOK is not unsealed and the AES step runs
+  // with the key record as the crypto services hold it.
+  if (ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize)) {
+    // A missing password file leaves the password cleared; the TPM then
+    // refuses it and the digest check rejects the result.
+    ReadKeyFile(keymgr::kKeyPwdPath, password.data(), kTpmSecretSize);
+    if (!ReadKeyFile(keymgr::kStoredOokPath, storedOok.data(), storedOok.size())) {
+      DebugPrint("Failed to open keymgr.ook\n");
+      return 1;
+    }
+    DebugPrint("Successed to open keymgr.ook\n");
+    HexOf(identity, nameHex);
+    HexOf(password, passHex);
+    // Only the first 268 bytes of the file are the sealed fragment.
+    if (pcp_decryptDataFragment(nameHex.c_str(), passHex.c_str(), storedOok.data(),
+                                kStoredOokPassed, ook.data(), &ookSize) == 0) {
+      DebugPrint("Successed to decrypt OOK.\n");
+    } else {
+      DebugPrint("Failed to decrypt OOK.\n");
+    }
+    // Shown on every call, as a diagnostic; the digest check decides.
+    DebugPrint("one_off_key: ");
+    PrintArray(ook.data(), kOneOffKeySize);
+    BindOneOffKey(context, ook);
+  }
+
+  VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
+  ProtectedKey_Attach(&context->secretKeyPK, 0, context->secretKeyBytes);
+  if (RunAes(context, DTC_AES_DECRYPT, &context->storeKeyPK, &context->secretKeyPK,
+             &context->secretKeyLength) != 0) {
+    return 1;
+  }
+  DebugPrint("ST Key is decrypted!!\n");
+  return 0;
+}
