@@ -13,12 +13,16 @@ echo "== Installing missing build dependencies (if any)"
 bash scripts/install-deps.sh
 
 echo "== Building keymgr in $build/ with every fixed path under $root"
-cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" -DBUILD_TESTING=OFF >/dev/null
+tcti="swtpm:path=$root/run/swtpm.sock"
+cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" -DKEYMGR_TCTI="$tcti" \
+  -DBUILD_TESTING=OFF >/dev/null
 cmake --build "$build" -j "$jobs"
 keymgr="$build/cli/keymgr"
 eeprom="$build/tools/keymgr-eeprom"
+kmm_host="$build/tools/kmm-host"
 
 echo "== Creating a fresh sandbox in $root"
+if [ -f "$root/run/swtpm.pid" ]; then scripts/swtpm-fixture.sh stop "$tcti" >/dev/null; fi
 rm -rf "$root"
 mkdir -p "$root/quorvan/hidden" "$root/quorvan/spool/log" "$root/etc" "$root/usr/bin"
 printf 'hostname=demo-device\n' >"$root/etc/device.conf"
@@ -59,7 +63,45 @@ echo "== Checking the altered file by hand: keymgr file PATH"
 "$keymgr" file "$root/etc/device.conf"
 
 # ---------------------------------------------------------------------------
-# Key management (KeyManage through kmm-host) follows here.
+# Key management: KeyManage through the example host kmm-host, against a
+# software TPM (swtpm) standing in for the device's TPM.
 # ---------------------------------------------------------------------------
+
+echo "== Starting a software TPM at $root/run/swtpm.sock"
+mkdir -p "$root/run"
+scripts/swtpm-fixture.sh start "$tcti"
+trap 'scripts/swtpm-fixture.sh stop "$tcti" >/dev/null' EXIT
+
+echo "== Turning SFE_003 on (SFE CONF word at 4958 = 4), so the key check logs its DT line"
+"$eeprom" write 4958 04000000
+echo "== Accepting the altered file (keymgr hash) and booting again: the log starts with BN=OK"
+"$keymgr" hash
+"$keymgr"
+
+echo "== Regenerating the key material: kmm-host 3"
+status=0
+"$kmm_host" 3 || status=$?
+echo "Exit status: $status"
+echo "Store key in EEPROM at 4244: $("$eeprom" read 4244 48)"
+echo "SC digest in EEPROM at 32256: $("$eeprom" read 32256 32)"
+for f in keymgr.cs keymgr.hddkeyid keymgr.hddpwd keymgr.ook; do
+  echo "  $root/quorvan/hidden/$f: $(stat -c %s "$root/quorvan/hidden/$f") bytes"
+done
+echo "Persistent TPM keys: $(tpm2_getcap handles-persistent -T "$tcti" | tr '\n' ' ')"
+
+echo "== Normal boot proof with logging: kmm-host 1 1"
+"$kmm_host" 1 1
+echo "Boot status log:"
+cat "$root/quorvan/spool/log/keymgr.log"
+
+echo "== Altering keymgr.hddpwd (the TPM key's password) and proving again"
+pwd_file="$root/quorvan/hidden/keymgr.hddpwd"
+first=$(od -An -tu1 -N1 "$pwd_file" | tr -d ' ')
+printf "\\x$(printf %02x $((first ^ 0xFF)))" | dd of="$pwd_file" bs=1 conv=notrunc status=none
+status=0
+"$kmm_host" 1 1 || status=$?
+echo "Exit status: $status"
+echo "Boot status log:"
+cat "$root/quorvan/spool/log/keymgr.log"
 
 echo "== Demo finished"
