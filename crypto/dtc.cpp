@@ -14,6 +14,7 @@
 #include <cstring>
 
 #include "keymgr_build_config.h"
+#include "util/bytes.h"
 #include "util/secure.h"
 
 namespace {
@@ -40,22 +41,9 @@ constexpr std::array<std::uint8_t, kIvSize> kAesIv = {
 
 // The expected digest of the disk-mapper tool (constant 3), taken from the
 // build option at compile time; configure has already checked its form.
-constexpr int HexValue(char c) {
-  if (c >= '0' && c <= '9') {
-    return c - '0';
-  }
-  if (c >= 'a' && c <= 'f') {
-    return c - 'a' + 10;
-  }
-  if (c >= 'A' && c <= 'F') {
-    return c - 'A' + 10;
-  }
-  return -1;
-}
-
 constexpr bool IsDigestText(const char* text) {
   for (std::size_t i = 0; i < 2 * kDigestSize; ++i) {
-    if (HexValue(text[i]) < 0) {
+    if (HexDigitValue(text[i]) < 0) {
       return false;
     }
   }
@@ -65,7 +53,8 @@ constexpr bool IsDigestText(const char* text) {
 constexpr std::array<std::uint8_t, kDigestSize> ParseDigest(const char* text) {
   std::array<std::uint8_t, kDigestSize> out{};
   for (std::size_t i = 0; i < kDigestSize; ++i) {
-    out[i] = static_cast<std::uint8_t>(HexValue(text[2 * i]) * 16 + HexValue(text[2 * i + 1]));
+    out[i] =
+        static_cast<std::uint8_t>(HexDigitValue(text[2 * i]) * 16 + HexDigitValue(text[2 * i + 1]));
   }
   return out;
 }

@@ -27,8 +27,8 @@ constexpr char kEntryFormat[] = "%99s";
 enum class EntryRead { kEntry, kEnd, kTooLong };
 
 // ReadEntry reads the next white-space separated manifest entry. An entry
-// that does not fit the path buffer is consumed to its end and reported as
-// too long, so the next read starts at the following entry.
+// that does not fit the path buffer is reported, consumed to its end and
+// returned as too long, which fails it like an entry that cannot be hashed.
 EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
   if (std::fscanf(manifest, kEntryFormat, entry.data()) != 1) {
     return EntryRead::kEnd;
@@ -40,11 +40,8 @@ EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
   while (next != EOF && !std::isspace(next)) {
     next = std::getc(manifest);
   }
-  return EntryRead::kTooLong;
-}
-
-void ReportTooLong(const EntryBuffer& entry) {
   DebugPrint("file[%.40s...] name too long!!\n", entry.data());
+  return EntryRead::kTooLong;
 }
 
 // HashEntry computes the digest of one entry and prints the failure line.
@@ -123,15 +120,7 @@ int HashManifest() {
   if (!OpenBoth("w", digests, manifest)) {
     return 1;
   }
-  for (;;) {
-    EntryRead read = ReadEntry(manifest.get(), entry);
-    if (read == EntryRead::kEnd) {
-      break;
-    }
-    if (read == EntryRead::kTooLong) {
-      ReportTooLong(entry);
-      break;
-    }
+  while (ReadEntry(manifest.get(), entry) == EntryRead::kEntry) {
     Digest digest{};
     if (!HashEntry(entry, digest)) {
       break;
@@ -153,15 +142,7 @@ void VerifyManifestFile(const char* path) {
   if (!OpenBoth("r", digests, manifest)) {
     return;
   }
-  for (;;) {
-    EntryRead read = ReadEntry(manifest.get(), entry);
-    if (read == EntryRead::kEnd) {
-      break;
-    }
-    if (read == EntryRead::kTooLong) {
-      ReportTooLong(entry);
-      break;
-    }
+  while (ReadEntry(manifest.get(), entry) == EntryRead::kEntry) {
     if (std::strcmp(entry.data(), path) != 0) {
       // Skip this entry's record to stay in step with the manifest.
       Digest skipped{};
@@ -191,16 +172,8 @@ int VerifyManifest(int verbose) {
     WriteBootStatus(kBootStatusBnFail);
     return 1;
   }
-  for (;;) {
-    EntryRead read = ReadEntry(manifest.get(), entry);
-    if (read == EntryRead::kEnd) {
-      break;
-    }
-    if (read == EntryRead::kTooLong) {
-      ReportTooLong(entry);
-      failed = 1;
-      break;
-    }
+  EntryRead read = EntryRead::kEnd;
+  while ((read = ReadEntry(manifest.get(), entry)) == EntryRead::kEntry) {
     // Failures to hash are reported whatever the verbose flag.
     Digest digest{};
     if (!HashEntry(entry, digest)) {
@@ -224,6 +197,9 @@ int VerifyManifest(int verbose) {
       break;
     }
     entry.fill(0);
+  }
+  if (read == EntryRead::kTooLong) {
+    failed = 1;
   }
   CloseBoth(digests, manifest);
   // The outcome travels only in the status line; the result says whether the

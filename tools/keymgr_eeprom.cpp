@@ -15,6 +15,7 @@
 #include <cstring>
 
 #include "platform/eeprom.h"
+#include "util/bytes.h"
 #include "util/paths.h"
 #include "util/secure.h"
 
@@ -55,19 +56,6 @@ bool ParseNumber(const char* text, std::uint32_t* value) {
   }
   *value = static_cast<std::uint32_t>(parsed);
   return true;
-}
-
-int HexDigit(char c) {
-  if (c >= '0' && c <= '9') {
-    return c - '0';
-  }
-  if (c >= 'a' && c <= 'f') {
-    return c - 'a' + 10;
-  }
-  if (c >= 'A' && c <= 'F') {
-    return c - 'A' + 10;
-  }
-  return -1;
 }
 
 // MakeParents creates every missing directory above |path|.
@@ -149,8 +137,8 @@ int Write(const char* offsetText, const char* hex) {
   static std::uint8_t bytes[kImageSize];
   const auto length = static_cast<std::uint32_t>(digits / 2);
   for (std::uint32_t i = 0; i < length; ++i) {
-    int high = HexDigit(hex[2 * i]);
-    int low = HexDigit(hex[2 * i + 1]);
+    int high = HexDigitValue(hex[2 * i]);
+    int low = HexDigitValue(hex[2 * i + 1]);
     if (high < 0 || low < 0) {
       return Usage();
     }

@@ -20,3 +20,18 @@ int Md5OfString(const char* text, std::uint8_t* digest);
 // NUL into |dst|, which holds |dstSize| bytes. Returns 0, or -1 with a message
 // and |dst| untouched on a null pointer, a zero size or a short |dst|.
 int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize);
+
+// HexDigitValue returns the value of one hexadecimal digit of either case,
+// or -1 for any other character.
+constexpr int HexDigitValue(char c) {
+  if (c >= '0' && c <= '9') {
+    return c - '0';
+  }
+  if (c >= 'a' && c <= 'f') {
+    return c - 'a' + 10;
+  }
+  if (c >= 'A' && c <= 'F') {
+    return c - 'A' + 10;
+  }
+  return -1;
+}
