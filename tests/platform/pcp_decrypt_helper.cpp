@@ -1,26 +1,19 @@
-// pcp_decrypt_helper NAMEHEX PASSHEX FRAGMENT_FILE opens a sealed fragment
-// the way a later boot does, in a fresh process, and prints the plaintext as
-// "%02X " groups. Exit 0 on success, 1 when the key manager fails, 2 on usage.
+// pcp_decrypt_helper NAMEHEX PASSHEX FRAGMENT opens a sealed fragment, given
+// as "%02X " groups, in a process of its own, as a later boot does, and
+// writes the plaintext to stdout. Exit 1 when that fails.
 #include <cstdio>
+#include <cstdlib>
 
 #include "platform/pcp.h"
 
 int main(int argc, char** argv) {
-  std::FILE* file = argc == 4 ? std::fopen(argv[3], "rb") : nullptr;
-  if (file == nullptr) {
-    return 2;
+  uint8_t fragment[PCP_FRAGMENT_SIZE], plain[32];
+  uint32_t length = 0, size = sizeof(plain);
+  for (char* at = argc == 4 ? argv[3] : nullptr; at && *at && length < sizeof(fragment);) {
+    fragment[length++] = static_cast<uint8_t>(std::strtoul(at, &at, 16));
   }
-  uint8_t fragment[PCP_FRAGMENT_SIZE];
-  size_t length = std::fread(fragment, 1, sizeof(fragment), file);
-  std::fclose(file);
-  uint8_t plain[32];
-  uint32_t plainSize = sizeof(plain);
-  if (pcp_decryptDataFragment(argv[1], argv[2], fragment, static_cast<uint32_t>(length), plain,
-                              &plainSize) != 0) {
+  if (argc != 4 || pcp_decryptDataFragment(argv[1], argv[2], fragment, length, plain, &size) != 0) {
     return 1;
   }
-  for (uint32_t i = 0; i < plainSize; ++i) {
-    std::printf("%02X ", plain[i]);
-  }
-  return 0;
+  std::fwrite(plain, 1, size, stdout);
 }
