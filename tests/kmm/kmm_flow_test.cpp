@@ -274,7 +274,7 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
           "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
       {3, crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
       {3, crypto(kAesProcess, 1, 0, 32), "ook\nDTC_AES Failed.\n" + kStore, kFiles},
-      {3, eeprom(4291, 4292, 1), "Write Error [-5] - Store Key to EEPROM !!!\n", kFiles},
+      {3, eeprom(4291, 4292, 1), "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
       {1, eeprom(4291, 4292, 1), kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
       {1, eeprom(4244, 4245, 3), Retries(kRead) + kFail, "DT=FAIL\n"},
       {1, [] { std::fill_n(&g_image[4244], 2, 0); }, Retries(kValues) + "Normal Boot", "-"},
