@@ -1,18 +1,14 @@
-// The boot status log in process, and end-to-end runs of the built keymgr in
-// the sandbox root.
-#include "cli/boot_status.h"
-
+// End-to-end runs of the built keymgr in the sandbox root, and the boot status
+// lines that follow the BN line.
+#include <openssl/sha.h>
 #include <sys/stat.h>
 
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <functional>
-#include <optional>
-#include <string>
-#include <vector>
 
+#include "cli/boot_status.h"
 #include "keymgr_build_config.h"
 #include "support/sandbox.h"
 
@@ -20,201 +16,109 @@ namespace {
 
 namespace t = keymgr::test;
 namespace fs = std::filesystem;
-using Args = std::vector<std::string>;
-using Text = std::optional<std::string>;
 
 const std::string kLog = t::InRoot("/quorvan/spool/log/keymgr.log");
 const std::string kDigests = t::InRoot("/quorvan/hidden/keymgr.cb");
 const std::string kManifest = t::InRoot("/quorvan/hidden/keymgr.list");
-const std::string kOn = "SFE_003 - [4]\n";
-const std::string kOff = "SFE_003 - [0]\n";
-const std::string kReadError = "Read Error [-2] - SFE CONF from EEPROM !!!\n";
+const std::string kOn = "SFE_003 - [4]\n", kOff = "SFE_003 - [0]\n";
+const std::string a = t::InRoot("/d/a"), b = t::InRoot("/d/b"), c = t::InRoot("/d/c");
 
-template <typename F>
-std::string Output(F call) {
+std::string Status(std::initializer_list<unsigned int> codes) {
   testing::internal::CaptureStdout();
-  call();
-  std::fflush(stdout);
+  for (unsigned int code : codes) {
+    WriteBootStatus(code);
+  }
   return testing::internal::GetCapturedStdout();
 }
 
-TEST(BootStatusTest, WriteBootStatusStartsOrAppendsTheLog) {
-  const Text none;
-  const std::string kUnknown = kOn + "Unknown flag!!\n";
-  struct Case {
-    unsigned int code;
-    std::uint32_t sfe;
-    Text before;
-    std::string out;
-    Text after;
-  } cases[] = {{0, 0, "BN=FAIL\nDT=OK\n", "BN=OK\n", "BN=OK\n"},
-               {1, 4, none, "BN=FAIL\n", "BN=FAIL\n"},
-               {2, 0, "BN=OK\n", kOff, "BN=OK\n"},
-               {2, 4, "BN=OK\n", kOn + "DT=OK\n", "BN=OK\nDT=OK\n"},
-               {3, 4, none, kOn + "DT=FAIL\n", "DT=FAIL\n"},
-               {4, 4, "X\n", kOn + "ST=OK\n", "X\nST=OK\n"},
-               {5, 4, "X\n", kOn + "ST=FAIL\n", "X\nST=FAIL\n"},
-               {6, 4, "X\n", kUnknown, "X\n"},
-               {0xFFFFFFFF, 4, none, kUnknown, ""},
-               {9, 0, none, kOff, none}};
-  for (const Case& c : cases) {
-    t::ResetSandbox();
-    t::MakeEeprom(0x00, c.sfe);
-    if (c.before) {
-      t::WriteFile(kLog, *c.before);
-    }
-    EXPECT_EQ(Output([&] { WriteBootStatus(c.code); }), c.out) << c.code;
-    EXPECT_EQ(t::ReadFile(kLog), c.after) << c.code;
-  }
+TEST(BootStatusTest, LaterLinesAreAppendedOnlyWithSfe003) {
+  t::ResetSandbox();
   t::MakeEeprom(0x00, 4);
-  std::filesystem::remove_all(t::InRoot("/quorvan/spool"));
-  EXPECT_EQ(Output([] { WriteBootStatus(3); }), kOn + "file[" + kLog + "] open error!!\n");
-  std::filesystem::remove(KEYMGR_EEPROM_PATH);
-  EXPECT_EQ(Output([] { WriteBootStatus(2); }), kReadError);
+  EXPECT_EQ(Status({2, 3, 4, 5, 0xFFFFFFFF}), kOn + "DT=OK\n" + kOn + "DT=FAIL\n" + kOn +
+                                                  "ST=OK\n" + kOn + "ST=FAIL\n" + kOn +
+                                                  "Unknown flag!!\n");
+  t::MakeEeprom(0x42, 0);
+  EXPECT_EQ(Status({3}), kOff);
+  EXPECT_EQ(t::ReadFile(kLog), "DT=OK\nDT=FAIL\nST=OK\nST=FAIL\n");
+  fs::remove_all(t::InRoot("/quorvan/spool"));
+  EXPECT_EQ(Status({1}), "file[" + kLog + "] open error!!\n");
 }
 
-std::string Data(const std::string& name) {
-  return t::InRoot("/data/" + name);
+std::string Sha(const std::string& text) {
+  std::string digest(32, '\0');
+  SHA256(reinterpret_cast<const unsigned char*>(text.data()), text.size(),
+         reinterpret_cast<unsigned char*>(digest.data()));
+  return digest;
 }
 
-t::RunResult Keymgr(Args args) {
-  args.insert(args.begin(), KEYMGR_TEST_KEYMGR_BIN);
-  return t::Run(args);
-}
-
-// Sha asks the sha256sum command, an implementation independent of ours, and
-// returns the "%02X " text the program prints.
-std::string Sha(const std::string& path) {
-  std::string hex = t::Run({"/usr/bin/sha256sum", path}).out, raw;
-  for (std::size_t i = 0; i < 64; i += 2) {
-    raw += static_cast<char>(std::stoi(hex.substr(i, 2), nullptr, 16));
-  }
-  return t::Hex(raw);
-}
-
-std::string Block(const std::string& name, const std::string& md, const std::string& rd) {
-  return "md_sha: " + md + "\nrd_sha: " + rd + "\n[" + Data(name) +
+std::string Block(const std::string& entry, const std::string& md, const std::string& rd) {
+  return "md_sha: " + t::Hex(md) + "\nrd_sha: " + t::Hex(rd) + "\n[" + entry +
          (md == rd ? "] has integrity!!\n\n" : "] is corrupted!!\n\n");
 }
 
-class KeymgrTest : public ::testing::Test {
- protected:
-  void SetUp() override {
+// Put writes |bytes| at |path|, or removes it when none are given.
+std::function<void()> Put(const std::string& path, std::optional<std::string> bytes = {}) {
+  return [=] { bytes ? t::WriteFile(path, *bytes) : void(fs::remove(path)); };
+}
+
+// Every run starts from a (empty), b, and c, a link to a file whose path has
+// 99 characters (the most an entry may hold), listed with mixed white space,
+// b twice; their records followed by bytes never read; a log left by an
+// earlier boot; and an EEPROM whose control byte alone opens the gate.
+TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN, E = Sha(""), B = Sha("b"), Z = Sha("z");
+  const std::string l99 = t::InRoot("/" + std::string(98 - t::Root().size(), 'z'));
+  const std::string pass = kOff + "BN=OK\n", fail = "BN=FAIL\n", records = E + B + B + Z;
+  const std::string first3 = kOff + Block(a, E, E) + Block(b, B, B) + Block(b, B, B);
+  const std::string tooLong = "file[" + l99.substr(0, 40) + "...] name too long!!\n";
+  const std::string aOpen = kOff + "file[" + a + "] open error!!\n" + fail;
+  struct Case {
+    std::vector<std::string> args;
+    std::string out;
+    std::function<void()> change = [] {};
+    int status = 0;
+    std::optional<std::string> digests = {};  // what hash leaves; others leave it alone
+  } cases[] = {
+      {{K, "logall"}, first3 + Block(c, Z, Z) + "BN=OK\n"},
+      {{K, "fil"}, pass},
+      {{K, "-"}, pass},
+      {{K, "has"}, kOn + "BN=OK\n", [] { t::MakeEeprom(0x00, 4); }},
+      {{K}, kOff, [] { t::MakeEeprom(0x43, 0xFFFFFFFB); }},
+      {{K, "log"}, kOff, [] { t::MakeEeprom(0x02, 0); }},
+      {{K}, "Read Error [-2] - SFE CONF from EEPROM !!!\n", Put(KEYMGR_EEPROM_PATH)},
+      {{K, "-vx"}, "Version: 2.3\n"},
+      {{K, "file"}, ""},
+      {{K, "filecheck", b, "x"}, Block(b, B, B), Put(kDigests, E + B + Sha("x"))},
+      {{K, "hashes"}, "", Put(kDigests), 0, records},
+      {{K, "hash"}, "file[" + b + "] status error!!\n", Put(b), 0, E},
+      {{K, "hash"}, kManifest + " open error!!!\n", Put(kManifest), 0, ""},
+      {{K, "hash"}, tooLong, Put(kManifest, l99 + " " + l99 + "z " + c), 0, Z},
+      {{K, "log"}, kOff + Block(a, E, E) + Block(b, Sha("altered"), B) + fail, Put(b, "altered")},
+      {{K}, kOff + "file[" + b + "] status error!!\n" + fail, Put(b)},
+      {{K, "log"}, first3 + Block(c, Z, std::string(32, '\0')) + fail, Put(kDigests, E + B + B)},
+      {{K}, pass, Put(kManifest, " \n\t")},
+      {{K, "log"}, kOff + kDigests + " open error!!!\n" + fail, Put(kDigests), 1},
+      {{K}, kOff + kManifest + " open error!!!\n" + fail, Put(kManifest), 1},
+      {{K}, kOff + tooLong + fail, Put(kManifest, l99 + "z")},
+      {{K}, aOpen, [] { fs::remove(a), mkfifo(a.c_str(), 0600); }},
+      {{K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
+  };
+  for (const Case& k : cases) {
     t::ResetSandbox();
     t::MakeEeprom(0x42, 0);
-    for (const char* name : {"a", "b", "c"}) {
-      t::WriteFile(Data(name), std::string("contents of ") + name);
-    }
-    t::WriteFile(kManifest, Data("a") + "\n" + Data("b") + "\n" + Data("c") + "\n");
-    ASSERT_EQ(Keymgr({"hash"}).status, 0);
+    t::WriteFile(a, ""), t::WriteFile(b, "b"), t::WriteFile(l99, "z");
+    fs::create_symlink(l99, c);
+    t::WriteFile(kManifest, a + " \t" + b + "\n\n" + b + "\t" + c + "\n");
+    t::WriteFile(kDigests, records + "junk");
     t::WriteFile(kLog, "OLD\n");
-    a_ = Sha(Data("a")), b_ = Sha(Data("b")), c_ = Sha(Data("c"));
-  }
-  std::string a_, b_, c_;
-};
-
-TEST_F(KeymgrTest, HashBuildsDigestsThatTheVerboseBootRunAccepts) {
-  EXPECT_EQ(t::Hex(*t::ReadFile(kDigests)), a_ + b_ + c_);
-  auto run = Keymgr({"log"});
-  EXPECT_EQ(run.status, 0);
-  EXPECT_EQ(run.out,
-            kOff + Block("a", a_, a_) + Block("b", b_, b_) + Block("c", c_, c_) + "BN=OK\n");
-  EXPECT_EQ(t::ReadFile(kLog), "BN=OK\n");
-}
-
-TEST_F(KeymgrTest, EitherEepromTestOpensTheGate) {
-  struct Case {
-    std::uint8_t control;
-    std::uint32_t sfe;
-    Args args;
-    bool runs;
-  } cases[] = {{0x42, 0, {}, true},           {0x43, 0, {}, false},
-               {0x02, 0, {}, false},          {0x00, 4, {}, true},
-               {0x43, 0xFFFFFFFB, {}, false}, {0x00, 0x04040400, {}, false},
-               {0x00, 0, {"log"}, false},     {0x42, 0, {"v"}, true},
-               {0x42, 0, {"-"}, true},        {0x42, 0, {"has"}, true}};
-  for (const Case& c : cases) {
-    t::MakeEeprom(c.control, c.sfe);
-    t::WriteFile(kLog, "OLD\n");
-    auto run = Keymgr(c.args);
-    EXPECT_EQ(run.status, 0);
-    EXPECT_EQ(run.out, (c.sfe == 4 ? kOn : kOff) + (c.runs ? "BN=OK\n" : ""))
-        << int(c.control) << " " << c.args.size();
-    EXPECT_EQ(t::ReadFile(kLog), std::string(c.runs ? "BN=OK\n" : "OLD\n")) << int(c.control);
-  }
-  fs::remove(KEYMGR_EEPROM_PATH);
-  t::WriteFile(kLog, "OLD\n");
-  auto run = Keymgr({});
-  EXPECT_EQ(run.status, 0);
-  EXPECT_EQ(run.out, kReadError);
-  EXPECT_EQ(t::ReadFile(kLog), "OLD\n");
-}
-
-TEST_F(KeymgrTest, MaintenanceWordsMatchAsPrefixesAndIgnoreTheGate) {
-  t::MakeEeprom(0x00, 0);
-  fs::remove(kLog);
-  fs::remove(kDigests);
-  struct Case {
-    Args args;
-    std::string out;
-  } cases[] = {{{"-vx"}, "Version: 2.3\n"},
-               {{"file"}, ""},
-               {{"hashes"}, ""},
-               {{"filecheck", Data("b"), "x"}, Block("b", b_, b_)}};
-  for (const Case& c : cases) {
-    auto run = Keymgr(c.args);
-    EXPECT_EQ(run.status, 0) << c.args[0];
-    EXPECT_EQ(run.out, c.out) << c.args[0];
-  }
-  EXPECT_EQ(t::Hex(*t::ReadFile(kDigests)), a_ + b_ + c_);
-  EXPECT_FALSE(t::Exists(kLog));
-}
-
-TEST_F(KeymgrTest, OutcomeGoesToTheLogAndOnlyOpenErrorsToTheStatus) {
-  const std::string zeros = t::Hex(std::string(32, '\0')), name(150, 'x');
-  struct Case {
-    std::function<std::string()> setup;  // returns the expected output
-    Args args = {};
-    int status = 0;
-  } cases[] = {
-      {[&] {
-         t::WriteFile(Data("b"), "altered");
-         return Block("a", a_, a_) + Block("b", Sha(Data("b")), b_) + "BN=FAIL\n";
-       },
-       {"log"}},
-      {[] { return fs::remove(Data("b")), "file[" + Data("b") + "] status error!!\nBN=FAIL\n"; }},
-      {[&] {
-         fs::resize_file(kDigests, 64);
-         return Block("a", a_, a_) + Block("b", b_, b_) + Block("c", c_, zeros) + "BN=FAIL\n";
-       },
-       {"log"}},
-      {[] { return t::WriteFile(kDigests, *t::ReadFile(kDigests) + "junk"), "BN=OK\n"; }},
-      {[] { return t::WriteFile(kManifest, " \n\t"), t::WriteFile(kDigests, ""), "BN=OK\n"; }},
-      {[] { return fs::remove(kDigests), kDigests + " open error!!!\nBN=FAIL\n"; }, {"log"}, 1},
-      {[] { return fs::remove(kManifest), kManifest + " open error!!!\nBN=FAIL\n"; }, {}, 1},
-      {[&] {
-        t::WriteFile(kManifest, Data("a") + " " + name + " " + Data("c"));
-        return "file[" + name.substr(0, 40) + "...] name too long!!\nBN=FAIL\n";
-      }},
-      {[] {
-        mkfifo(Data("fifo").c_str(), 0600);
-        t::WriteFile(kManifest, Data("fifo"));
-        return "file[" + Data("fifo") + "] open error!!\nBN=FAIL\n";
-      }},
-      {[] {
-        return fs::remove_all(t::InRoot("/quorvan/spool")), "file[" + kLog + "] open error!!\n";
-      }},
-  };
-  for (const Case& c : cases) {
-    SetUp();
-    std::string out = c.setup();
-    auto run = Keymgr(c.args);
-    EXPECT_EQ(run.status, c.status) << out;
-    EXPECT_EQ(run.out, kOff + out);
-    // The log holds the BN line alone, or is lost with its directory.
-    auto bn = out.find("BN=");
-    EXPECT_EQ(t::ReadFile(kLog),
-              bn == std::string::npos ? std::nullopt : std::optional(out.substr(bn)));
+    k.change();
+    const auto digests = t::ReadFile(kDigests);
+    auto run = t::Run(k.args);
+    EXPECT_EQ(std::to_string(run.status) + run.out, std::to_string(k.status) + k.out);
+    // A BN line starts the log anew; nothing else touches it.
+    const auto bn = k.out.find("BN=");
+    EXPECT_EQ(t::ReadFile(kLog), bn == std::string::npos ? "OLD\n" : k.out.substr(bn)) << k.out;
+    EXPECT_EQ(t::ReadFile(kDigests), k.digests ? k.digests : digests) << k.out;
   }
 }
 

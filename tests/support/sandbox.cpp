@@ -1,20 +1,16 @@
 #include "support/sandbox.h"
 
-#include <fcntl.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <sstream>
+#include <regex>
 #include <stdexcept>
 
 #include "keymgr_build_config.h"
-
-extern char** environ;
 
 namespace keymgr::test {
 
@@ -41,19 +37,14 @@ void ResetSandbox() {
 
 void WriteFile(const std::string& path, std::string_view bytes) {
   fs::create_directories(fs::path(path).parent_path());
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-  if (!out) {
+  if (!std::ofstream(path, std::ios::binary).write(bytes.data(), std::ssize(bytes))) {
     throw std::runtime_error("cannot write " + path);
   }
 }
 
 std::optional<std::string> ReadFile(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
-  if (!in) {
-    return std::nullopt;
-  }
-  return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+  return in ? std::optional(std::string(std::istreambuf_iterator<char>(in), {})) : std::nullopt;
 }
 
 bool Exists(const std::string& path) {
@@ -61,72 +52,41 @@ bool Exists(const std::string& path) {
 }
 
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf) {
-  std::string image(kEepromSize, '\xFF');
-  image[kControlByteOffset] = static_cast<char>(control);
-  for (int i = 0; i < 4; ++i) {
-    image[kSfeConfOffset + i] = static_cast<char>((sfeConf >> (8 * i)) & 0xFF);
-  }
-  WriteFile(KEYMGR_EEPROM_PATH, image);
+  WriteFile(KEYMGR_EEPROM_PATH, std::string(32768, '\xFF'));
+  const auto byte = [&](int shift) { return static_cast<std::uint8_t>(sfeConf >> shift); };
+  WriteEepromBytes(kControlByteOffset, {control});
+  WriteEepromBytes(kSfeConfOffset, {byte(0), byte(8), byte(16), byte(24)});
 }
 
+// Both throw (std::out_of_range, std::bad_optional_access) on a missing image.
 std::vector<std::uint8_t> ReadEepromBytes(std::uint32_t offset, std::uint32_t length) {
-  auto image = ReadFile(KEYMGR_EEPROM_PATH);
-  if (!image || image->size() < offset + length) {
-    throw std::runtime_error("EEPROM image missing or short");
-  }
-  return {image->begin() + offset, image->begin() + offset + length};
+  std::string bytes = ReadFile(KEYMGR_EEPROM_PATH).value().substr(offset, length);
+  return {bytes.begin(), bytes.end()};
 }
 
 void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& bytes) {
-  std::fstream f(KEYMGR_EEPROM_PATH, std::ios::binary | std::ios::in | std::ios::out);
-  f.seekp(offset);
-  f.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-  if (!f) {
-    throw std::runtime_error("cannot patch the EEPROM image");
-  }
+  std::string image = ReadFile(KEYMGR_EEPROM_PATH).value();
+  WriteFile(KEYMGR_EEPROM_PATH, image.replace(offset, bytes.size(), {bytes.begin(), bytes.end()}));
 }
 
-RunResult Run(const std::vector<std::string>& argv, const std::string& cwd) {
-  char outName[] = "/tmp/keymgr-run-out-XXXXXX";
-  char errName[] = "/tmp/keymgr-run-err-XXXXXX";
-  int outFd = mkstemp(outName);
-  int errFd = mkstemp(errName);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
-  posix_spawn_file_actions_adddup2(&actions, outFd, 1);
-  posix_spawn_file_actions_adddup2(&actions, errFd, 2);
-  if (!cwd.empty()) {
-    posix_spawn_file_actions_addchdir_np(&actions, cwd.c_str());
+// Run goes through the shell for its redirections, which then execs argv[0]
+// itself, so a signal still shows as -1.
+RunResult Run(const std::vector<std::string>& argv) {
+  const std::string out = "/tmp/keymgr-run-" + std::to_string(getpid()), err = out + ".err";
+  std::string command = "exec";
+  for (const auto& arg : argv) {
+    command += " '" + std::regex_replace(arg, std::regex("'"), "'\\''") + "'";
   }
-  std::vector<char*> args;
-  for (const auto& a : argv) {
-    args.push_back(const_cast<char*>(a.c_str()));
-  }
-  args.push_back(nullptr);
-  pid_t pid = -1;
-  RunResult result;
-  if (posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ) == 0) {
-    int wstatus = 0;
-    waitpid(pid, &wstatus, 0);
-    result.status = WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : -1;
-  }
-  posix_spawn_file_actions_destroy(&actions);
-  close(outFd);
-  close(errFd);
-  result.out = ReadFile(outName).value_or("");
-  result.err = ReadFile(errName).value_or("");
-  unlink(outName);
-  unlink(errName);
+  const int wstatus = std::system((command + " </dev/null >" + out + " 2>" + err).c_str());
+  RunResult result{WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : -1, *ReadFile(out), *ReadFile(err)};
+  fs::remove(out), fs::remove(err);
   return result;
 }
 
 std::string Hex(std::string_view bytes) {
   std::string text;
-  char buf[4];
   for (unsigned char c : bytes) {
-    std::snprintf(buf, sizeof(buf), "%02X ", c);
-    text += buf;
+    text += {"0123456789ABCDEF"[c >> 4], "0123456789ABCDEF"[c & 0x0F], ' '};
   }
   return text;
 }

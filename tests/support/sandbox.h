@@ -10,7 +10,6 @@
 
 namespace keymgr::test {
 
-inline constexpr std::size_t kEepromSize = 32768;
 inline constexpr std::uint32_t kControlByteOffset = 5049;
 inline constexpr std::uint32_t kSfeConfOffset = 4958;
 
@@ -34,12 +33,11 @@ void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& byt
 
 struct RunResult {
   int status = -1;  // exit status, or -1 when the program did not exit normally
-  std::string out;
-  std::string err;
+  std::string out, err;
 };
 
-// Run starts argv[0] with the arguments in |cwd| (when given) and waits.
-RunResult Run(const std::vector<std::string>& argv, const std::string& cwd = "");
+// Run starts argv[0] with the arguments, stdin on /dev/null, and waits.
+RunResult Run(const std::vector<std::string>& argv);
 
 // Hex renders bytes as upper-case "%02X " groups, the way the programs print.
 std::string Hex(std::string_view bytes);
