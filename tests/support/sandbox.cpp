@@ -52,7 +52,7 @@ bool Exists(const std::string& path) {
 }
 
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf) {
-  WriteFile(KEYMGR_EEPROM_PATH, std::string(32768, '\xFF'));
+  WriteFile(KEYMGR_EEPROM_PATH, std::string(kEepromSize, '\xFF'));
   const auto byte = [&](int shift) { return static_cast<std::uint8_t>(sfeConf >> shift); };
   WriteEepromBytes(kControlByteOffset, {control});
   WriteEepromBytes(kSfeConfOffset, {byte(0), byte(8), byte(16), byte(24)});

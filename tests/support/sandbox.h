@@ -10,6 +10,7 @@
 
 namespace keymgr::test {
 
+inline constexpr std::size_t kEepromSize = 32768;
 inline constexpr std::uint32_t kControlByteOffset = 5049;
 inline constexpr std::uint32_t kSfeConfOffset = 4958;
 
