@@ -89,6 +89,9 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
       {{K, "-vx"}, "Version: 2.3\n"},
       {{K, "file"}, ""},
       {{K, "filecheck", b, "x"}, Block(b, B, B), Put(kDigests, E + B + Sha("x"))},
+      {{K, "file", "d/b"}, ""},
+      {{K, "file", b}, "file[" + b + "] status error!!\n", Put(b)},
+      {{K, "file", b}, kDigests + " open error!!!\n", Put(kDigests)},
       {{K, "hashes"}, "", Put(kDigests), 0, records},
       {{K, "hash"}, "file[" + b + "] status error!!\n", Put(b), 0, E},
       {{K, "hash"}, kManifest + " open error!!!\n", Put(kManifest), 0, ""},
@@ -102,8 +105,9 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
       {{K}, kOff + tooLong + fail, Put(kManifest, l99 + "z")},
       {{K}, aOpen, [] { fs::remove(a), mkfifo(a.c_str(), 0600); }},
       {{K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
+      {{K}, aOpen, [] { fs::resize_file(a, (1ULL << 32) + 1); }},
   };
-  for (const Case& k : cases) {
+  const auto setUp = [&] {
     t::ResetSandbox();
     t::MakeEeprom(0x42, 0);
     t::WriteFile(a, ""), t::WriteFile(b, "b"), t::WriteFile(l99, "z");
@@ -111,6 +115,9 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
     t::WriteFile(kManifest, a + " \t" + b + "\n\n" + b + "\t" + c + "\n");
     t::WriteFile(kDigests, records + "junk");
     t::WriteFile(kLog, "OLD\n");
+  };
+  for (const Case& k : cases) {
+    setUp();
     k.change();
     const auto digests = t::ReadFile(kDigests);
     auto run = t::Run(k.args);
@@ -120,6 +127,18 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
     EXPECT_EQ(t::ReadFile(kLog), bn == std::string::npos ? "OLD\n" : k.out.substr(bn)) << k.out;
     EXPECT_EQ(t::ReadFile(kDigests), k.digests ? k.digests : digests) << k.out;
   }
+
+  // An independent SHA-256 agrees with the records that hash writes.
+  setUp();
+  t::Run({K, "hash"});
+  std::string sums;
+  for (const auto& [path, at] : {std::pair{a, 0}, {b, 32}, {c, 96}}) {
+    for (unsigned char ch : t::ReadFile(kDigests)->substr(at, 32)) {
+      sums += "0123456789abcdef"[ch >> 4], sums += "0123456789abcdef"[ch & 15];
+    }
+    sums += "  " + path + "\n";
+  }
+  EXPECT_EQ(t::Run({"/usr/bin/sha256sum", a, b, c}).out, sums);
 }
 
 }  // namespace
