@@ -67,6 +67,24 @@ bool InRange(std::uint64_t offset, std::uint64_t length, std::uint64_t start, st
   return offset >= start && offset + length <= start + size;
 }
 
+// MoveAll repeats |io| (pread or pwrite) until |length| bytes have moved at
+// |offset|; false on an error or an image that ends early.
+template <class Io, class Byte>
+bool MoveAll(Io io, int fd, Byte* bytes, std::uint32_t length, std::uint32_t offset) {
+  std::uint32_t done = 0;
+  while (done < length) {
+    ssize_t moved = io(fd, bytes + done, length - done, static_cast<off_t>(offset) + done);
+    if (moved < 0 && errno == EINTR) {
+      continue;
+    }
+    if (moved <= 0) {
+      return false;
+    }
+    done += static_cast<std::uint32_t>(moved);
+  }
+  return true;
+}
+
 int ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst) {
   int check = CheckRequest(device, length, dst);
   if (check < 0) {
@@ -93,17 +111,8 @@ int ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst)
     OPENSSL_cleanse(scratch, length);
     std::free(scratch);
   });
-  std::uint32_t done = 0;
-  while (done < length) {
-    ssize_t got =
-        ::pread(image.fd, scratch + done, length - done, static_cast<off_t>(offset) + done);
-    if (got < 0 && errno == EINTR) {
-      continue;
-    }
-    if (got <= 0) {
-      return kIoError;
-    }
-    done += static_cast<std::uint32_t>(got);
+  if (!MoveAll(::pread, image.fd, scratch, length, offset)) {
+    return kIoError;
   }
   std::memcpy(dst, scratch, length);
   return static_cast<int>(length);
@@ -130,18 +139,8 @@ int WriteImage(int device, std::uint32_t offset, std::uint32_t length, const voi
   if (!InRange(offset, length, 0, image.size)) {
     return kOutOfRange;
   }
-  const auto* bytes = static_cast<const std::uint8_t*>(src);
-  std::uint32_t done = 0;
-  while (done < length) {
-    ssize_t put =
-        ::pwrite(image.fd, bytes + done, length - done, static_cast<off_t>(offset) + done);
-    if (put < 0 && errno == EINTR) {
-      continue;
-    }
-    if (put <= 0) {
-      return kIoError;
-    }
-    done += static_cast<std::uint32_t>(put);
+  if (!MoveAll(::pwrite, image.fd, static_cast<const std::uint8_t*>(src), length, offset)) {
+    return kIoError;
   }
   if (::fdatasync(image.fd) != 0) {
     return kIoError;
