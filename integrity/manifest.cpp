@@ -8,6 +8,7 @@
 #include <span>
 
 #include "cli/boot_status.h"
+#include "util/atomic_file.h"
 #include "util/debug_print.h"
 #include "util/file_digest.h"
 #include "util/paths.h"
@@ -87,17 +88,29 @@ bool SameDigest(const Digest& a, const Digest& b) {
   return std::memcmp(a.data(), b.data(), kFileDigestSize) == 0;
 }
 
-// OpenBoth opens the digest file with |digestMode|, then the manifest, and
-// prints the open error of the one that failed.
-bool OpenBoth(const char* digestMode, File& digests, File& manifest) {
-  digests = keymgr::OpenFile(keymgr::kDigestFilePath, digestMode);
+void PrintOpenError(const char* path) {
+  DebugPrint("%s open error!!!\n", path);
+}
+
+// OpenManifest opens the manifest, printing its open error on failure.
+File OpenManifest() {
+  File manifest = keymgr::OpenFile(keymgr::kManifestPath, "r");
+  if (!manifest) {
+    PrintOpenError(keymgr::kManifestPath);
+  }
+  return manifest;
+}
+
+// OpenBoth opens the digest file for reading, then the manifest, and prints
+// the open error of the one that failed.
+bool OpenBoth(File& digests, File& manifest) {
+  digests = keymgr::OpenFile(keymgr::kDigestFilePath, "r");
   if (!digests) {
-    DebugPrint("%s open error!!!\n", keymgr::kDigestFilePath);
+    PrintOpenError(keymgr::kDigestFilePath);
     return false;
   }
-  manifest = keymgr::OpenFile(keymgr::kManifestPath, "r");
+  manifest = OpenManifest();
   if (!manifest) {
-    DebugPrint("%s open error!!!\n", keymgr::kManifestPath);
     digests.reset();
     return false;
   }
@@ -114,22 +127,32 @@ void CloseBoth(File& digests, File& manifest) {
 
 int HashManifest() {
   EntryBuffer entry{};
-  File digests;
-  File manifest;
-  // The digest file is truncated first: a missing manifest leaves it empty.
-  if (!OpenBoth("w", digests, manifest)) {
+  // The new digest file is built aside and replaces the old one whole at the
+  // end, so a run killed part way leaves the old file intact. Its end states
+  // stay those of a file truncated first: empty when the manifest is missing,
+  // the records before a failed entry otherwise.
+  keymgr::AtomicFile digests;
+  if (!digests.Open(keymgr::kDigestFilePath, keymgr::kDigestFileMode)) {
+    PrintOpenError(keymgr::kDigestFilePath);
     return 1;
   }
-  while (ReadEntry(manifest.get(), entry) == EntryRead::kEntry) {
+  File manifest = OpenManifest();
+  int result = manifest ? 0 : 1;
+  while (manifest && ReadEntry(manifest.get(), entry) == EntryRead::kEntry) {
     Digest digest{};
     if (!HashEntry(entry, digest)) {
       break;
     }
-    (void)std::fwrite(digest.data(), 1, digest.size(), digests.get());
+    digests.Write(digest.data(), digest.size());
     entry.fill(0);
   }
-  CloseBoth(digests, manifest);
-  return 0;
+  // A digest file that cannot be put in place fails like one that cannot be
+  // opened.
+  if (!digests.Commit()) {
+    PrintOpenError(keymgr::kDigestFilePath);
+    result = 1;
+  }
+  return result;
 }
 
 void VerifyManifestFile(const char* path) {
@@ -139,7 +162,7 @@ void VerifyManifestFile(const char* path) {
   }
   File digests;
   File manifest;
-  if (!OpenBoth("r", digests, manifest)) {
+  if (!OpenBoth(digests, manifest)) {
     return;
   }
   while (ReadEntry(manifest.get(), entry) == EntryRead::kEntry) {
@@ -168,7 +191,7 @@ int VerifyManifest(int verbose) {
   EntryBuffer entry{};
   File digests;
   File manifest;
-  if (!OpenBoth("r", digests, manifest)) {
+  if (!OpenBoth(digests, manifest)) {
     WriteBootStatus(kBootStatusBnFail);
     return 1;
   }

@@ -5,6 +5,7 @@
 
 #include "kmm/internal.h"
 #include "platform/eeprom.h"
+#include "util/atomic_file.h"
 #include "util/debug_print.h"
 #include "util/paths.h"
 #include "util/secure.h"
@@ -58,13 +59,11 @@ int ReadDigestEEPROM(std::uint8_t* dst) {
 }
 
 int WriteDigestHDD(const std::uint8_t* digest) {
-  keymgr::File file = keymgr::OpenFile(keymgr::kScDigestPath, "w");
-  if (!file) {
+  // Replaced whole, so a crash never leaves a torn copy beside the EEPROM's.
+  if (!keymgr::ReplaceFile(keymgr::kScDigestPath, digest, kDigestSize, keymgr::kSecretFileMode)) {
     DebugPrint("%s open error!!!\n", keymgr::kScDigestPath);
     return 1;
   }
-  // A short write shows up at the next boot as a digest mismatch.
-  std::fwrite(digest, 1, kDigestSize, file.get());
   return 0;
 }
 

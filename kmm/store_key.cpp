@@ -8,6 +8,7 @@
 
 #include "kmm/internal.h"
 #include "platform/pcp.h"
+#include "util/atomic_file.h"
 #include "util/bytes.h"
 #include "util/debug_print.h"
 #include "util/paths.h"
@@ -41,16 +42,16 @@ bool ReadKeyFile(const char* path, std::uint8_t* dst, std::size_t size) {
   return true;
 }
 
-// WriteKeyFile replaces |path| with |size| bytes of |src|, reporting the open
-// under the file's short |name|.
+// WriteKeyFile replaces |path| with |size| bytes of |src|, reporting it under
+// the file's short |name|. The whole replacement counts as the open: the
+// success line follows only once the new file is durably in place, and a
+// failure leaves the old file whole.
 bool WriteKeyFile(const char* path, const char* name, const std::uint8_t* src, std::size_t size) {
-  keymgr::File file = keymgr::OpenFile(path, "w");
-  if (!file) {
+  if (!keymgr::ReplaceFile(path, src, size, keymgr::kSecretFileMode)) {
     DebugPrint("Failed to open %s\n", name);
     return false;
   }
   DebugPrint("Successed to open %s\n", name);
-  std::fwrite(src, 1, size, file.get());
   return true;
 }
 
@@ -150,7 +151,8 @@ int GenerateStoreKey(KeyContext* context) {
   }
   DebugPrint("Successed to encrypt Stored-OOK.\n");
 
-  // Fixed order, written in place: a failure leaves a mixed generation.
+  // Fixed order, each file replaced whole: a failure leaves a mixed
+  // generation, every file of it intact.
   if (!WriteKeyFile(keymgr::kKeyIdPath, "keymgr.hddkeyid", identity.data(), kTpmSecretSize) ||
       !WriteKeyFile(keymgr::kKeyPwdPath, "keymgr.hddpwd", password.data(), kTpmSecretSize) ||
       !WriteKeyFile(keymgr::kStoredOokPath, "keymgr.ook", storedOok.data(), storedOok.size())) {

@@ -20,6 +20,11 @@ inline constexpr char kStoredOokPath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.ook
 inline constexpr char kDmsetupPath[] = KEYMGR_ROOT "/usr/local/dev-mapper/sbin/dmsetup";
 inline constexpr char kEepromPath[] = KEYMGR_EEPROM_PATH;
 
+// Modes of the files the system replaces under /quorvan/hidden: key material
+// (the key files and the SC digest copy) is for the owner alone.
+inline constexpr unsigned int kSecretFileMode = 0600;
+inline constexpr unsigned int kDigestFileMode = 0644;
+
 // The longest fixed path must still fit a path buffer with its terminator.
 static_assert(sizeof(kDmsetupPath) <= kPathBufferSize, "KEYMGR_ROOT is too long");
 static_assert(sizeof(kKeyIdPath) <= kPathBufferSize, "KEYMGR_ROOT is too long");

@@ -141,4 +141,46 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
   EXPECT_EQ(t::Run({"/usr/bin/sha256sum", a, b, c}).out, sums);
 }
 
+// keymgr hash killed anywhere leaves the old digest file or the new one,
+// never a torn or empty one, and the boot after it ends cleanly.
+TEST(KeymgrTest, KilledHashLeavesTheOldOrTheNewDigestFile) {
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN;
+  t::ResetSandbox();
+  t::MakeEeprom(0x42, 0);
+  std::string list;
+  for (int i = 0; i < 3000; ++i) {
+    list += t::InRoot("/f/" + std::to_string(i)) + "\n";
+    t::WriteFile(t::InRoot("/f/" + std::to_string(i)), std::to_string(i));
+  }
+  t::WriteFile(kManifest, list);
+  t::Run({K, "hash"});
+  const std::string old = *t::ReadFile(kDigests);
+  t::WriteFile(t::InRoot("/f/2999"), "altered");
+  // Synced, renamed into place, and the folder synced.
+  EXPECT_EQ(t::SyncTrace({K, "hash"}), "F L R:keymgr.cb D ");
+  const std::string fresh = *t::ReadFile(kDigests);
+  ASSERT_EQ(fresh.size(), old.size());
+
+  std::vector<std::pair<std::string, int>> points = {
+      {"fsync", 1}, {"fsync", 2}, {"linkat", 1}, {"renameat", 1}};
+  for (int n = 1; n <= 24; n += 3) {
+    points.emplace_back("write", n);
+  }
+  for (int n = 100; n <= 3000; n += 450) {
+    points.emplace_back("openat", n);
+  }
+  for (const auto& [call, n] : points) {
+    SCOPED_TRACE(call + std::to_string(n));
+    t::WriteFile(kDigests, old);
+    EXPECT_TRUE(t::RunKilledAt(call, n, {K, "hash"}));
+    for (const auto& entry : fs::directory_iterator(t::InRoot("/quorvan/hidden"))) {
+      const std::string name = entry.path().filename(), bytes = *t::ReadFile(entry.path());
+      EXPECT_TRUE(name == "keymgr.list" || (name == "keymgr.cb" && bytes == old) || bytes == fresh)
+          << name;
+    }
+    const auto boot = t::Run({K});
+    EXPECT_EQ(boot.out, kOff + (*t::ReadFile(kDigests) == fresh ? "BN=OK\n" : "BN=FAIL\n"));
+  }
+}
+
 }  // namespace

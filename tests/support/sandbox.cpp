@@ -1,7 +1,10 @@
 #include "support/sandbox.h"
 
+#include <fcntl.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <csignal>
 
 #include <cstdlib>
 #include <filesystem>
@@ -81,6 +84,91 @@ RunResult Run(const std::vector<std::string>& argv) {
   RunResult result{WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : -1, *ReadFile(out), *ReadFile(err)};
   fs::remove(out), fs::remove(err);
   return result;
+}
+
+// StraceArgs puts argv under strace with |options|. With seccomp-bpf the
+// program stops only at the traced calls, which keeps long runs fast.
+std::vector<std::string> StraceArgs(std::vector<std::string> options,
+                                    const std::vector<std::string>& argv) {
+  options.insert(options.begin(), {"strace", "--seccomp-bpf", "-f"});
+  options.insert(options.end(), argv.begin(), argv.end());
+  return options;
+}
+
+// Ended tells whether process |pid| has ended (gone, or a zombie).
+bool Ended(pid_t pid) {
+  const auto stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
+  return !stat || stat->find(") Z ") != std::string::npos;
+}
+
+// strace holds the nth call at its entry, where the log shows it with the
+// program's process id. The program gets SIGKILL there, then strace is
+// killed: the program leaves its stop with the signal pending, and the
+// kernel skips the call. (strace's own signal injection does not work
+// together with seccomp-bpf.)
+bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>& argv) {
+  const std::string log = "/tmp/keymgr-kill-" + std::to_string(getpid());
+  const auto args = StraceArgs({"-o", log, "-e", "trace=" + call, "-e",
+                                "inject=" + call + ":delay_enter=60s:when=" + std::to_string(n)},
+                               argv);
+  fs::remove(log);
+  const pid_t strace = fork();
+  if (strace == 0) {
+    const int null = open("/dev/null", O_RDWR);
+    dup2(null, 0), dup2(null, 1), dup2(null, 2);
+    std::vector<char*> raw;
+    for (const auto& arg : args) {
+      raw.push_back(const_cast<char*>(arg.c_str()));
+    }
+    raw.push_back(nullptr);
+    execvp(raw[0], raw.data());
+    _exit(127);
+  }
+  const std::regex entered("(?:^|\\n)(\\d+) +" + call + "\\(");
+  int status = 0;
+  pid_t victim = 0;
+  while (victim == 0 && waitpid(strace, &status, WNOHANG) == 0) {
+    const std::string text = ReadFile(log).value_or("");
+    std::sregex_iterator it(text.begin(), text.end(), entered), end;
+    for (int seen = 1; it != end && seen < n; ++it, ++seen) {
+    }
+    if (it != end) {
+      victim = std::stoi((*it)[1]);
+      kill(victim, SIGKILL);
+      kill(strace, SIGKILL);
+      waitpid(strace, &status, 0);
+      while (!Ended(victim)) {
+        usleep(1000);
+      }
+    } else {
+      usleep(1000);
+    }
+  }
+  fs::remove(log);
+  return victim != 0;
+}
+
+std::string SyncTrace(const std::vector<std::string>& argv) {
+  const std::string log = "/tmp/keymgr-strace-" + std::to_string(getpid());
+  Run(StraceArgs({"-o", log, "-y", "-e", "trace=fsync,linkat,renameat"}, argv));
+  // PID fsync(3</path>) = 0, linkat(...) = 0, renameat(4<dir>, "old", 4<dir>, "new") = 0
+  static const std::regex kCall(R"re(\d+ +(\w+)\(\d+<([^>]*)>.*?(?:"([^"]*)"\))? = 0)re");
+  std::string summary, line;
+  std::ifstream in(log);
+  for (std::smatch m; std::getline(in, line);) {
+    if (!std::regex_match(line, m, kCall)) {
+      continue;
+    }
+    if (m[1] == "fsync") {
+      summary += fs::is_directory(m[2].str()) ? "D " : "F ";
+    } else if (m[1] == "linkat") {
+      summary += "L ";
+    } else {
+      summary += "R:" + m[3].str() + " ";
+    }
+  }
+  fs::remove(log);
+  return summary;
 }
 
 std::string Hex(std::string_view bytes) {

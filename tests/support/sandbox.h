@@ -40,6 +40,16 @@ struct RunResult {
 // Run starts argv[0] with the arguments, stdin on /dev/null, and waits.
 RunResult Run(const std::vector<std::string>& argv);
 
+// RunKilledAt runs argv, output discarded, and kills it with SIGKILL on entry
+// to its |n|th call of the system call |call|, before that call runs. Returns
+// true when it was killed there, false when it ended first.
+bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>& argv);
+
+// SyncTrace runs argv under strace and sums up, in order, how it replaced
+// files: "F" an fsync of a file, "D" of a folder, "L" a link, "R:name" a
+// rename onto |name|.
+std::string SyncTrace(const std::vector<std::string>& argv);
+
 // Hex renders bytes as upper-case "%02X " groups, the way the programs print.
 std::string Hex(std::string_view bytes);
 
