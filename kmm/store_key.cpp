@@ -105,10 +105,16 @@ int GenerateStoreKey(KeyContext* context) {
   std::uint32_t storedOokSize = kStoredOokSize;
 
   // The previous generation's TPM key goes first; on a first generation
-  // there is none and nothing is said about it.
-  if (ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize)) {
+  // there is none and nothing is said about it. Keys of this system that no
+  // key file names (left by a killed regeneration) can never be used again
+  // and are evicted silently, so they do not fill the TPM over the years.
+  const bool hadIdentity = ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize);
+  if (hadIdentity) {
     HexOf(identity, nameHex);
     Md5OfString(nameHex.c_str(), nameDigest.data());
+  }
+  (void)pcp_evict_stale_keys(hadIdentity ? nameDigest.data() : nullptr);
+  if (hadIdentity) {
     if (pcp_delete_key(nameDigest.data(), 0) == 0) {
       DebugPrint("Successed to delete ID/PWD in TPM.\n");
     } else {
@@ -144,6 +150,14 @@ int GenerateStoreKey(KeyContext* context) {
     return 1;
   }
   DebugPrint("Successed to create OOK.\n");
+  // Until its identity is on disk nothing can ever name the new key again:
+  // a failure before that evicts it (a leak fix, not a rollback).
+  bool identityStored = false;
+  keymgr::ScopeExit evictUnnamed([&] {
+    if (!identityStored) {
+      (void)pcp_delete_key(nameDigest.data(), 0);
+    }
+  });
   if (pcp_encryptDataFragment(nameHex.c_str(), passHex.c_str(), ook.data(), kOneOffKeySize,
                               storedOok.data(), &storedOokSize) != 0) {
     DebugPrint("Failed to encrypt Stored-OOK.\n");
@@ -153,7 +167,9 @@ int GenerateStoreKey(KeyContext* context) {
 
   // Fixed order, each file replaced whole: a failure leaves a mixed
   // generation, every file of it intact.
-  if (!WriteKeyFile(keymgr::kKeyIdPath, "keymgr.hddkeyid", identity.data(), kTpmSecretSize) ||
+  identityStored =
+      WriteKeyFile(keymgr::kKeyIdPath, "keymgr.hddkeyid", identity.data(), kTpmSecretSize);
+  if (!identityStored ||
       !WriteKeyFile(keymgr::kKeyPwdPath, "keymgr.hddpwd", password.data(), kTpmSecretSize) ||
       !WriteKeyFile(keymgr::kStoredOokPath, "keymgr.ook", storedOok.data(), storedOok.size())) {
     return 1;

@@ -1,5 +1,7 @@
 // Platform key manager over a TPM 2.0. Each call opens the TPM on the
-// KEYMGR_TCTI transport, does its work and closes it again. Every call
+// KEYMGR_TCTI transport, does its work and closes it again. Without a
+// resource manager on that transport, each call first flushes what a dead
+// process left loaded. Every call
 // returns 0 on success and non-zero on failure; no TPM error ends the process.
 #pragma once
 
@@ -18,12 +20,21 @@ int pcp_getRandomBytes(uint32_t count, uint8_t* dst);
 
 // pcp_create_key creates an RSA-|bits| decryption key authorised by the 16
 // bytes |passwordDigest| and makes it persistent at the handle derived from
-// the 16 bytes |nameDigest|. Fails when that handle is taken.
+// the 16 bytes |nameDigest|. Fails when that handle is taken. The key's
+// template marks it as this key manager's own.
 int pcp_create_key(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint32_t bits,
                    uint32_t flags);
 
-// pcp_delete_key evicts the persistent key of |nameDigest|.
+// pcp_delete_key evicts the persistent key of |nameDigest|. An object there
+// that this key manager did not create is left alone and the call fails, as
+// for a missing key.
 int pcp_delete_key(const uint8_t* nameDigest, uint32_t flags);
+
+// pcp_evict_stale_keys evicts every persistent key this key manager created
+// except the one of |keepNameDigest| (NULL keeps none): keys whose identity
+// never reached the disk, left by a regeneration that was killed. Returns 0,
+// or non-zero when the TPM could not be searched or a key not evicted.
+int pcp_evict_stale_keys(const uint8_t* keepNameDigest);
 
 // pcp_encryptDataFragment seals |length| bytes of |data| under the key whose
 // name digest is the MD5 of |nameHex|. |*outSize| is the capacity of |out|

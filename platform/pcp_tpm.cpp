@@ -8,6 +8,7 @@
 
 #include <openssl/crypto.h>
 #include <tss2/tss2_esys.h>
+#include <tss2/tss2_sys.h>
 #include <tss2/tss2_tctildr.h>
 
 #include <algorithm>
@@ -40,6 +41,20 @@ constexpr uint32_t kMaxCipherSize = PCP_FRAGMENT_SIZE - kHeaderSize;
 // OAEP with SHA-256 spends two digests and two bytes of the modulus.
 constexpr uint32_t kOaepOverhead = 2 * 32 + 2;
 
+// Keys this key manager creates carry this authPolicy, the SHA-256 of
+// "keymgr: sealing key of the one-off key". No policy session can reach it
+// (that would take a preimage), so it grants nothing, but it marks the key:
+// only objects that carry it, with the exact template below, are ever
+// evicted, never what other software made persistent in the owner range.
+constexpr uint8_t kKeyMarker[32] = {
+    0x6d, 0x92, 0x2a, 0xfd, 0xc6, 0xec, 0xa3, 0xf8, 0x6b, 0xc5, 0xa5, 0x93, 0xa1, 0x93, 0x9a, 0x34,
+    0x0c, 0xe7, 0x29, 0x9b, 0x0e, 0x44, 0x81, 0x0d, 0x26, 0x78, 0xc8, 0x7b, 0x01, 0x65, 0x84, 0xd6};
+constexpr TPMA_OBJECT kKeyAttributes = TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
+                                       TPMA_OBJECT_FIXEDPARENT | TPMA_OBJECT_SENSITIVEDATAORIGIN |
+                                       TPMA_OBJECT_USERWITHAUTH | TPMA_OBJECT_NODA;
+constexpr uint32_t kOwnerPersistentFirst = 0x81000000u;
+constexpr uint32_t kOwnerPersistentLast = 0x817FFFFFu;
+
 // Keys are made persistent in the owner range 0x81000000-0x817FFFFF: the low
 // 23 bits of the handle are the first three bytes of the name digest read
 // big-endian, top bit dropped. MD5 spreads the names evenly, so two live keys
@@ -47,7 +62,25 @@ constexpr uint32_t kOaepOverhead = 2 * 32 + 2;
 // refuses rather than overwrite the other key.
 uint32_t PersistentHandle(const uint8_t* nameDigest) {
   uint32_t low = (uint32_t{nameDigest[0]} << 16) | (uint32_t{nameDigest[1]} << 8) | nameDigest[2];
-  return 0x81000000u | (low & 0x007FFFFFu);
+  return kOwnerPersistentFirst | (low & 0x007FFFFFu);
+}
+
+// IsOwnKey tells whether |area| is the public area of a key this key manager
+// created: its template and its marker.
+bool IsOwnKey(const TPMT_PUBLIC& area) {
+  const TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
+  return area.type == TPM2_ALG_RSA && area.nameAlg == TPM2_ALG_SHA256 &&
+         area.objectAttributes == kKeyAttributes && area.authPolicy.size == sizeof(kKeyMarker) &&
+         std::memcmp(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker)) == 0 &&
+         rsa.symmetric.algorithm == TPM2_ALG_NULL && rsa.scheme.scheme == TPM2_ALG_OAEP &&
+         rsa.scheme.details.oaep.hashAlg == TPM2_ALG_SHA256;
+}
+
+// HasResourceManager tells whether |tcti| reaches the TPM through a resource
+// manager (the kernel's /dev/tpmrm*, or tpm2-abrmd), which isolates each
+// connection and flushes what it leaves behind.
+bool HasResourceManager(const char* tcti) {
+  return std::strncmp(tcti, "device:/dev/tpmrm", 17) == 0 || std::strncmp(tcti, "tabrmd", 6) == 0;
 }
 
 void PutBigEndian(uint8_t* dst, uint32_t value) {
@@ -110,6 +143,38 @@ struct Tpm {
   }
 };
 
+// FlushLeftovers flushes every transient object and session the TPM holds.
+// Without a resource manager the TPM keeps whatever a process loaded until
+// someone flushes it, so a process that died part way (killed, or its host
+// reset without the TPM) leaves its objects and sessions behind, and a few of
+// them fill the TPM's slots for good. It is safe here because without a
+// resource manager only one process can hold the TPM at a time (the kernel
+// opens /dev/tpm0 exclusively, a simulator serves one connection at a time):
+// whatever is loaded when a call starts belongs to nobody alive.
+void FlushLeftovers(Tpm& tpm) {
+  TSS2_SYS_CONTEXT* sys = nullptr;
+  if (Esys_GetSysContext(tpm.ctx, &sys) != TSS2_RC_SUCCESS) {
+    return;
+  }
+  for (uint32_t first :
+       {TPM2_TRANSIENT_FIRST, TPM2_LOADED_SESSION_FIRST, TPM2_ACTIVE_SESSION_FIRST}) {
+    TPMI_YES_NO more = TPM2_NO;
+    TPMS_CAPABILITY_DATA* data = nullptr;
+    if (Esys_GetCapability(tpm.ctx, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, TPM2_CAP_HANDLES,
+                           first, TPM2_MAX_CAP_HANDLES, &more, &data) != TSS2_RC_SUCCESS) {
+      continue;
+    }
+    // ESAPI knows nothing of these handles, so they go as raw commands.
+    for (uint32_t i = 0; i < data->data.handles.count; ++i) {
+      const TPM2_HANDLE handle = data->data.handles.handle[i];
+      if ((handle >> TPM2_HR_SHIFT) == (first >> TPM2_HR_SHIFT)) {
+        Tss2_Sys_FlushContext(sys, handle);
+      }
+    }
+    Esys_Free(data);
+  }
+}
+
 // Open connects to the TPM and starts it; "already started" is fine.
 bool Open(Tpm& tpm) {
   QuietTssLog();
@@ -121,7 +186,13 @@ bool Open(Tpm& tpm) {
     return false;
   }
   TSS2_RC rc = Esys_Startup(tpm.ctx, TPM2_SU_CLEAR);
-  return rc == TSS2_RC_SUCCESS || rc == TPM2_RC_INITIALIZE;
+  if (rc != TSS2_RC_SUCCESS && rc != TPM2_RC_INITIALIZE) {
+    return false;
+  }
+  if (!HasResourceManager(keymgr::kPcpTcti)) {
+    FlushLeftovers(tpm);
+  }
+  return true;
 }
 
 // CreatePrimary makes the owner hierarchy's storage primary key from a fixed
@@ -201,6 +272,37 @@ bool OpenKey(Tpm& tpm, const char* nameHex) {
   return true;
 }
 
+// OpenOwnKey opens the persistent object at |handle| and keeps it in
+// tpm.key only when it is a key of this key manager.
+bool OpenOwnKey(Tpm& tpm, uint32_t handle) {
+  if (Esys_TR_FromTPMPublic(tpm.ctx, handle, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, &tpm.key) !=
+      TSS2_RC_SUCCESS) {
+    tpm.key = ESYS_TR_NONE;
+    return false;
+  }
+  TPM2B_PUBLIC* keyPublic = nullptr;
+  bool own = Esys_ReadPublic(tpm.ctx, tpm.key, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, &keyPublic,
+                             nullptr, nullptr) == TSS2_RC_SUCCESS &&
+             IsOwnKey(keyPublic->publicArea);
+  Esys_Free(keyPublic);
+  if (!own) {
+    Esys_TR_Close(tpm.ctx, &tpm.key);
+    tpm.key = ESYS_TR_NONE;
+  }
+  return own;
+}
+
+// EvictKey evicts the key in tpm.key. ESAPI may release the handle of an
+// evicted persistent object, so it is never used again either way: whatever
+// ESAPI still holds goes with Esys_Finalize.
+bool EvictKey(Tpm& tpm, uint32_t handle) {
+  ESYS_TR none = ESYS_TR_NONE;
+  const ESYS_TR key = tpm.key;
+  tpm.key = ESYS_TR_NONE;
+  return Esys_EvictControl(tpm.ctx, ESYS_TR_RH_OWNER, key, ESYS_TR_PASSWORD, ESYS_TR_NONE,
+                           ESYS_TR_NONE, handle, &none) == TSS2_RC_SUCCESS;
+}
+
 TPMT_RSA_DECRYPT OaepSha256() {
   TPMT_RSA_DECRYPT scheme{};
   scheme.scheme = TPM2_ALG_OAEP;
@@ -269,9 +371,9 @@ int pcp_create_key(const uint8_t* nameDigest, const uint8_t* passwordDigest, uin
   TPMT_PUBLIC& area = templ.publicArea;
   area.type = TPM2_ALG_RSA;
   area.nameAlg = TPM2_ALG_SHA256;
-  area.objectAttributes = TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM | TPMA_OBJECT_FIXEDPARENT |
-                          TPMA_OBJECT_SENSITIVEDATAORIGIN | TPMA_OBJECT_USERWITHAUTH |
-                          TPMA_OBJECT_NODA;
+  area.objectAttributes = kKeyAttributes;
+  area.authPolicy.size = sizeof(kKeyMarker);
+  std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
   TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
   rsa.symmetric.algorithm = TPM2_ALG_NULL;
   rsa.scheme.scheme = TPM2_ALG_OAEP;
@@ -311,16 +413,40 @@ int pcp_delete_key(const uint8_t* nameDigest, uint32_t) {
   }
   uint32_t handle = PersistentHandle(nameDigest);
   Tpm tpm;
-  if (!Open(tpm) || Esys_TR_FromTPMPublic(tpm.ctx, handle, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
-                                          &tpm.key) != TSS2_RC_SUCCESS) {
-    tpm.key = ESYS_TR_NONE;
+  // An object this key manager did not create is left alone, as if absent.
+  if (!Open(tpm) || !OpenOwnKey(tpm, handle)) {
     return 1;
   }
-  ESYS_TR none = ESYS_TR_NONE;
-  return Esys_EvictControl(tpm.ctx, ESYS_TR_RH_OWNER, tpm.key, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                           ESYS_TR_NONE, handle, &none) == TSS2_RC_SUCCESS
-             ? 0
-             : 1;
+  return EvictKey(tpm, handle) ? 0 : 1;
+}
+
+int pcp_evict_stale_keys(const uint8_t* keepNameDigest) {
+  Tpm tpm;
+  if (!Open(tpm)) {
+    return 1;
+  }
+  const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
+  TPMI_YES_NO more = TPM2_NO;
+  TPMS_CAPABILITY_DATA* data = nullptr;
+  if (Esys_GetCapability(tpm.ctx, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, TPM2_CAP_HANDLES,
+                         kOwnerPersistentFirst, TPM2_MAX_CAP_HANDLES, &more,
+                         &data) != TSS2_RC_SUCCESS) {
+    return 1;
+  }
+  ScopeExit freeData([&] { Esys_Free(data); });
+  // A TPM holds a handful of persistent objects, far fewer than one answer
+  // can list, so |more| is not followed.
+  int result = 0;
+  for (uint32_t i = 0; i < data->data.handles.count; ++i) {
+    const uint32_t handle = data->data.handles.handle[i];
+    if (handle > kOwnerPersistentLast || handle == keep || !OpenOwnKey(tpm, handle)) {
+      continue;
+    }
+    if (!EvictKey(tpm, handle)) {
+      result = 1;
+    }
+  }
+  return result;
 }
 
 // The password is not needed to seal: only the key's public part is used.
@@ -341,8 +467,7 @@ int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* dat
   }
   const TPMT_PUBLIC& area = keyPublic->publicArea;
   uint32_t modulusSize = area.type == TPM2_ALG_RSA ? area.parameters.rsaDetail.keyBits / 8u : 0;
-  bool usable = (area.objectAttributes & TPMA_OBJECT_DECRYPT) != 0 && modulusSize > kOaepOverhead &&
-                modulusSize <= kMaxCipherSize;
+  bool usable = IsOwnKey(area) && modulusSize > kOaepOverhead && modulusSize <= kMaxCipherSize;
   Esys_Free(keyPublic);
   if (!usable || length > modulusSize - kOaepOverhead) {
     return 1;

@@ -113,6 +113,12 @@ int pcp_create_key(const uint8_t* name, const uint8_t* password, uint32_t bits, 
 int pcp_delete_key(const uint8_t* name, uint32_t) {
   return g_tpmKeys.erase(std::string(reinterpret_cast<const char*>(name), 16)) != 1;
 }
+int pcp_evict_stale_keys(const uint8_t* keep) {
+  std::erase_if(g_tpmKeys, [&](const auto& key) {
+    return keep == nullptr || key.first != std::string(reinterpret_cast<const char*>(keep), 16);
+  });
+  return 0;
+}
 int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
                             uint8_t* out, uint32_t* outSize) {
   if (g_pcpFail[kEncrypt]-- > 0 || g_tpmKeys.count(Md5(nameHex)) == 0 ||
@@ -253,7 +259,8 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
   };
   auto pcp = [](PcpOp op) { return [=] { g_pcpFail[op] = 1; }; };
   // What a regeneration leaves (see State): nothing, the digest, or also the key files.
-  const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - ";
+  // A key whose identity never reached the disk is evicted again.
+  const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
   const std::string kFiles = "- set 32 20 20 284 1";
   struct Row {
     int option;  // regenerations start from nothing, boots from a regeneration
@@ -268,8 +275,10 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
       {3, crypto(kCreate, 2, 0), "Failed. nRes=0x00000000\n" + kDigest, kNone},
       {3, eeprom(32256, 32288, 1), "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
       {3, pcp(kRandom), "Failed to generate one_off_key by TPM.\nSucc", "set" + kFiles.substr(1)},
-      {3, pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly + "0"},
-      {3, pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly + "1"},
+      {3, pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
+      {3, pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
+      {3, [] { fs::create_directory(kKeyIdPath); },
+          "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
       {3, [] { fs::create_directory(kKeyPwdPath); },
           "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
       {3, crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},

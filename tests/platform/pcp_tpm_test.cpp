@@ -81,3 +81,30 @@ TEST(PcpTpm, RoundTripRefusalsAndNoSecretOnTheBus) {
   EXPECT_NE(pcp_delete_key(name.digest, 0), 0) << "no key left to delete";
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
+
+// Only keys this key manager made are ever evicted: an object of other
+// software at the handle of a name is left alone, whether asked for by name
+// or swept with the stale keys.
+TEST(PcpTpm, OnlyOwnKeysAreEvicted) {
+  const std::string tcti = KEYMGR_TCTI, context = KEYMGR_ROOT "/run/foreign.ctx";
+  const uint8_t foreign[16] = {0x00, 0x12, 0x34};  // its handle is 0x81001234
+  ASSERT_EQ(keymgr::test::Run(
+                {"tpm2_createprimary", "-C", "o", "-G", "rsa2048", "-c", context, "-T", tcti})
+                .status,
+            0);
+  ASSERT_EQ(
+      keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", context, "0x81001234", "-T", tcti})
+          .status,
+      0);
+  const std::vector<std::string> getcap{TPM2_GETCAP_BIN, "handles-persistent", "-T", tcti};
+  const std::string withForeign = keymgr::test::Run(getcap).out;
+  Identity kept, stale;
+  ASSERT_EQ(pcp_create_key(kept.digest, kept.digest, 2048, 0), 0);
+  ASSERT_EQ(pcp_create_key(stale.digest, stale.digest, 2048, 0), 0);
+  EXPECT_NE(pcp_delete_key(foreign, 0), 0);
+  EXPECT_EQ(pcp_evict_stale_keys(kept.digest), 0);
+  EXPECT_EQ(pcp_delete_key(kept.digest, 0), 0);
+  EXPECT_NE(pcp_delete_key(stale.digest, 0), 0) << "swept already";
+  EXPECT_EQ(keymgr::test::Run(getcap).out, withForeign);
+  keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", "0x81001234", "-T", tcti});
+}

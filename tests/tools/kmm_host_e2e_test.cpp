@@ -5,6 +5,7 @@
 
 #include <filesystem>
 #include <functional>
+#include <map>
 #include <regex>
 #include <set>
 
@@ -29,6 +30,13 @@ std::set<std::string> NewHandles(const std::set<std::string>& before = {}) {
     }
   }
   return handles;
+}
+
+// EvictNew evicts the keys a test left, so that the next starts from none.
+void EvictNew(const std::set<std::string>& before) {
+  for (const auto& handle : NewHandles(before)) {
+    test::Run({KEYMGR_TEST_TPM2_EVICTCONTROL, "-C", "o", "-c", handle, "-T", KEYMGR_TCTI});
+  }
 }
 
 TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
@@ -95,10 +103,57 @@ TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
   EXPECT_EQ(secondKey.size(), 1u);
   EXPECT_NE(boot(true).find("Success [EEPROM]!!\nSC Digest Test Success [HDD]!!\n"),
             std::string::npos);
-  for (const auto& handle : secondKey) {
-    test::Run({KEYMGR_TEST_TPM2_EVICTCONTROL, "-C", "o", "-c", handle, "-T", KEYMGR_TCTI});
-  }
+  EvictNew(before);
   EXPECT_TRUE(NewHandles(before).empty());
+}
+
+void StartRegenerationTest() {
+  ResetSandbox();
+  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "init"}).status, 0);
+  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "write", "4958", "04000000"}).status, 0);
+}
+
+// A regeneration killed at any file replacement or TPM command leaves every
+// key file whole, a boot that ends cleanly, and a TPM (with no resource
+// manager in front of it) on which the next regeneration succeeds.
+TEST(KmmHostE2e, KilledRegenerationsLeaveWholeFilesAndAWorkingTpm) {
+  StartRegenerationTest();
+  const auto before = NewHandles();
+  // Each file is synced, renamed into place and its folder synced, in order.
+  EXPECT_EQ(SyncTrace({KEYMGR_TEST_KMM_HOST_BIN, "3"}),
+            "F L R:keymgr.cs D F L R:keymgr.hddkeyid D F L R:keymgr.hddpwd D "
+            "F L R:keymgr.ook D ");
+  std::vector<std::pair<std::string, int>> points;
+  for (const char* call : {"fsync", "linkat", "renameat"}) {
+    for (int n = 1; n <= 4; ++n) {
+      points.emplace_back(call, n);
+    }
+  }
+  for (int n = 1; n <= 90; n += 7) {
+    points.emplace_back("write", n);  // mostly TPM commands
+  }
+  const std::map<std::string, std::size_t> sizes = {
+      {"keymgr.cs", 32}, {"keymgr.hddkeyid", 20}, {"keymgr.hddpwd", 20}, {"keymgr.ook", 284}};
+  int killed = 0;
+  for (const auto& [call, n] : points) {
+    SCOPED_TRACE(call + std::to_string(n));
+    killed += RunKilledAt(call, n, {KEYMGR_TEST_KMM_HOST_BIN, "3"});
+    for (const auto& entry : std::filesystem::directory_iterator(InRoot("/quorvan/hidden"))) {
+      const std::string name = entry.path().filename();
+      const auto size = sizes.find(name.starts_with('.') ? name.substr(1, name.size() - 5) : name);
+      ASSERT_NE(size, sizes.end()) << name;
+      EXPECT_EQ(entry.file_size(), size->second) << name;
+    }
+    const RunResult boot =
+        test::Run({"timeout", "-s", "KILL", "60", KEYMGR_TEST_KMM_HOST_BIN, "1", "1"});
+    EXPECT_EQ(boot.status, boot.out.find("\nDT=OK\n") != std::string::npos ? 0 : 1) << boot.out;
+    EXPECT_NE(boot.out.find(boot.status == 0 ? "\nDT=OK\n" : "\nDT=FAIL\n"), std::string::npos);
+  }
+  EXPECT_GE(killed, 10);
+  EXPECT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"}).status, 0);
+  EXPECT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "1"}).status, 0);
+  EXPECT_EQ(NewHandles(before).size(), 1u);
+  EvictNew(before);
 }
 
 }  // namespace
