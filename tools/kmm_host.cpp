@@ -48,6 +48,12 @@ int main(int argc, char** argv) {
       (argc == 3 && !ParseInt(argv[2], &logFlag))) {
     return Usage();
   }
+  // A regeneration's seed key comes from random(); without fresh seeding
+  // the secret key could be guessed, so that run does not go ahead.
+  if (KmmSeedRandom() < 0 && option == KMM_OPTION_REGENERATE) {
+    std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
+    return 1;
+  }
   KeyContext* context = KeyManage(option, logFlag);
   std::fflush(stdout);
   return context != nullptr ? 0 : 1;

@@ -51,6 +51,20 @@ typedef struct KeyContext {
  * not reentrant. */
 KeyContext* KeyManage(int32_t option, int logFlag);
 
+/* Sources that KmmSeedRandom reports. */
+#define KMM_ENTROPY_TPM 1
+#define KMM_ENTROPY_GETRANDOM 2
+
+/* KmmSeedRandom fills the whole state of the C library generator (random())
+ * with fresh random bytes: the TPM's, mixed with the kernel's getrandom, or
+ * the kernel's alone when the TPM cannot be reached. The module never seeds
+ * the generator itself and builds the seed key from it: a host that skips
+ * this call before KeyManage(KMM_OPTION_REGENERATE, ...) gets a guessable
+ * secret key. Returns KMM_ENTROPY_TPM or KMM_ENTROPY_GETRANDOM, the source
+ * used, or -1 when neither answered (the generator is then left as it was).
+ * It replaces whatever seeding the host did before. */
+int KmmSeedRandom(void);
+
 /* CheckDmsetupDigest compares the SHA-256 of the disk-mapper tool with the
  * built-in expected digest. Returns 0 on a match, -1 otherwise. */
 int CheckDmsetupDigest(void);

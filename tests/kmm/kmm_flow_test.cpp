@@ -15,6 +15,7 @@
 #include "platform/eeprom.h"
 #include "platform/pcp.h"
 #include "support/sandbox.h"
+#include "support/seed_guess.h"
 #include "util/bytes.h"
 #include "util/paths.h"
 
@@ -307,6 +308,29 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
     EXPECT_EQ(g_context == nullptr, out.ends_with("Error!!\n"));  // every failure ends so
     EXPECT_EQ(row.option == KMM_OPTION_REGENERATE ? State() : Text(kBootLogPath), row.after);
     EXPECT_EQ(g_live, 0);
+  }
+}
+
+// The search finds a key from random() seeded the weak ways, so it proves
+// something when it fails on one seeded by the host call: from the TPM and
+// the kernel, or the kernel alone.
+TEST(KmmFlow, SeedKeyIsUnguessableOnlyAfterTheHostSeedsTheGenerator) {
+  for (unsigned int weak : {1u, static_cast<unsigned int>(std::time(nullptr)), 4321u}) {
+    Reset();
+    srandom(weak);
+    ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
+    EXPECT_NE(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "") << weak;
+  }
+  for (int tpmFails : {0, 1}) {
+    Reset();
+    g_pcpFail[kRandom] = tpmFails;
+    EXPECT_EQ(KmmSeedRandom(), tpmFails != 0 ? KMM_ENTROPY_GETRANDOM : KMM_ENTROPY_TPM);
+    ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
+    EXPECT_EQ(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "");
+    // random() still yields 31 bits: the top bit of each word's last byte is 0.
+    for (std::uint32_t at = 15; at < kmm::kSeedKeySize; at += 4) {
+      EXPECT_EQ(ProtectedKey_ByteAt(&g_context->seedKeyPK, at) & 0x80, 0) << at;
+    }
   }
 }
 

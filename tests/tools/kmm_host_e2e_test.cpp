@@ -1,16 +1,21 @@
 // kmm-host end to end: a real EEPROM image, the real crypto services and the
 // real key manager on the suite's swtpm. Each run is a new process, as at
 // boot.
+#include <sys/stat.h>
+
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <filesystem>
 #include <functional>
 #include <map>
 #include <regex>
 #include <set>
+#include <thread>
 
 #include "keymgr_build_config.h"
 #include "support/sandbox.h"
+#include "support/seed_guess.h"
 #include "util/paths.h"
 
 namespace keymgr::test {
@@ -111,6 +116,46 @@ void StartRegenerationTest() {
   ResetSandbox();
   ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "init"}).status, 0);
   ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "write", "4958", "04000000"}).status, 0);
+}
+
+// Two regenerations in one second, in two processes, under umask 000 and
+// with a symbolic link planted at keymgr.hddpwd.
+TEST(KmmHostE2e, KeyFilesArePrivateAndTheSecretKeyUnguessable) {
+  StartRegenerationTest();
+  const auto before = NewHandles();
+  const std::string outside = InRoot("/outside");
+  WriteFile(outside, "not a key file");
+  std::filesystem::create_symlink(outside, kKeyPwdPath);
+  const mode_t umaskWas = umask(0);
+  // Both runs within one second of the clock: start at the top of a second
+  // and try again when a slow key generation spills into the next.
+  std::string digests[2];
+  for (int attempt = 0; attempt < 5; ++attempt) {
+    using std::chrono::system_clock;
+    const auto second = std::chrono::ceil<std::chrono::seconds>(system_clock::now());
+    // time() reads a coarse clock that lags the precise one by a tick.
+    std::this_thread::sleep_until(second + std::chrono::milliseconds(50));
+    for (std::string& digest : digests) {
+      ASSERT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"}).status, 0);
+      digest = *ReadFile(kScDigestPath);
+    }
+    if (system_clock::now() < second + std::chrono::seconds(1)) {
+      break;
+    }
+  }
+  umask(umaskWas);
+  EXPECT_NE(digests[0], digests[1]);
+  for (const std::string& digest : digests) {
+    EXPECT_EQ(GuessSeedKey(digest, std::time(nullptr)), "");
+  }
+  for (const char* path : {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath}) {
+    struct stat st {};
+    ASSERT_EQ(lstat(path, &st), 0) << path;
+    EXPECT_EQ(st.st_mode, S_IFREG | 0600) << path;
+  }
+  EXPECT_EQ(ReadFile(outside), "not a key file");
+  EXPECT_EQ(NewHandles(before).size(), 1u);
+  EvictNew(before);
 }
 
 // A regeneration killed at any file replacement or TPM command leaves every
