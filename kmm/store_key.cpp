@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "keymgr_build_config.h"
 #include "kmm/internal.h"
 #include "platform/pcp.h"
 #include "util/atomic_file.h"
@@ -220,9 +221,15 @@ int DecryptStoreKey(KeyContext* context) {
     } else {
       DebugPrint("Failed to decrypt OOK.\n");
     }
-    // Shown on every call, as a diagnostic; the digest check decides.
+    // Shown on every call, as a diagnostic; the digest check decides. With
+    // the store key from EEPROM the one-off key gives away the secret key,
+    // so a production build may show the line without its bytes.
     DebugPrint("one_off_key: ");
-    PrintArray(ook.data(), kOneOffKeySize);
+    if constexpr (KEYMGR_REDACT_OOK) {
+      PrintRedactedArray(kOneOffKeySize);
+    } else {
+      PrintArray(ook.data(), kOneOffKeySize);
+    }
     BindOneOffKey(context, ook);
   }
 

@@ -19,12 +19,29 @@ void PrintHexDump(const std::uint8_t* bytes, std::uint32_t length, int grouped) 
   DebugPrint("\n");
 }
 
-void PrintArray(const std::uint8_t* bytes, std::int32_t size) {
+namespace {
+
+// PrintArrayLine prints the bytes, or "**" for each when |bytes| is null.
+void PrintArrayLine(const std::uint8_t* bytes, std::int32_t size) {
   DebugPrint("print_array: size[%d] ", size);
   for (std::int32_t i = 0; i < size; ++i) {
-    DebugPrint("%02X ", bytes[i]);
+    if (bytes != nullptr) {
+      DebugPrint("%02X ", bytes[i]);
+    } else {
+      DebugPrint("** ");
+    }
   }
   DebugPrint(" \n");
+}
+
+}  // namespace
+
+void PrintArray(const std::uint8_t* bytes, std::int32_t size) {
+  PrintArrayLine(bytes, size);
+}
+
+void PrintRedactedArray(std::int32_t size) {
+  PrintArrayLine(nullptr, size);
 }
 
 int Md5OfString(const char* text, std::uint8_t* digest) {

@@ -12,6 +12,10 @@ void PrintHexDump(const std::uint8_t* bytes, std::uint32_t length, int grouped);
 // A size of 0 or less prints no bytes.
 void PrintArray(const std::uint8_t* bytes, std::int32_t size);
 
+// PrintRedactedArray prints what PrintArray would for |size| bytes, each
+// byte shown as "**": the line keeps its shape and gives nothing away.
+void PrintRedactedArray(std::int32_t size);
+
 // Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
 // bytes at |digest|. Always returns 0.
 int Md5OfString(const char* text, std::uint8_t* digest);
