@@ -11,6 +11,7 @@
 #include <cstring>
 
 #include "platform/pcp.h"
+#include "util/io.h"
 #include "util/secure.h"
 
 namespace {
@@ -22,29 +23,16 @@ constexpr std::size_t kStateWords = 64;
 std::array<std::uint32_t, kStateWords> g_state;
 constexpr std::size_t kDrawSize = (kStateWords - 1) * sizeof(std::uint32_t);
 
-// GetRandomAll fills |size| bytes from the kernel's generator.
-bool GetRandomAll(std::uint8_t* dst, std::size_t size) {
-  while (size > 0) {
-    ssize_t got = ::getrandom(dst, size, 0);
-    if (got < 0 && errno == EINTR) {
-      continue;
-    }
-    if (got <= 0) {
-      return false;
-    }
-    dst += got;
-    size -= static_cast<std::size_t>(got);
-  }
-  return true;
-}
-
 }  // namespace
 
 extern "C" int KmmSeedRandom(void) {
   keymgr::Secret<kDrawSize> tpm;
   keymgr::Secret<kDrawSize> kernel;
   const bool fromTpm = pcp_getRandomBytes(kDrawSize, tpm.data()) == 0;
-  const bool fromKernel = GetRandomAll(kernel.data(), kernel.size());
+  const bool fromKernel =
+      keymgr::MoveAll([&](std::size_t done,
+                          std::size_t left) { return ::getrandom(kernel.data() + done, left, 0); },
+                      kernel.size());
   if (!fromTpm && !fromKernel) {
     return -1;
   }

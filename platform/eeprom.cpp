@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "util/io.h"
 #include "util/paths.h"
 #include "util/secure.h"
 
@@ -67,22 +68,15 @@ bool InRange(std::uint64_t offset, std::uint64_t length, std::uint64_t start, st
   return offset >= start && offset + length <= start + size;
 }
 
-// MoveAll repeats |io| (pread or pwrite) until |length| bytes have moved at
+// MoveAt repeats |io| (pread or pwrite) until |length| bytes have moved at
 // |offset|; false on an error or an image that ends early.
 template <class Io, class Byte>
-bool MoveAll(Io io, int fd, Byte* bytes, std::uint32_t length, std::uint32_t offset) {
-  std::uint32_t done = 0;
-  while (done < length) {
-    ssize_t moved = io(fd, bytes + done, length - done, static_cast<off_t>(offset) + done);
-    if (moved < 0 && errno == EINTR) {
-      continue;
-    }
-    if (moved <= 0) {
-      return false;
-    }
-    done += static_cast<std::uint32_t>(moved);
-  }
-  return true;
+bool MoveAt(Io io, int fd, Byte* bytes, std::uint32_t length, std::uint32_t offset) {
+  return keymgr::MoveAll(
+      [&](std::size_t done, std::size_t left) {
+        return io(fd, bytes + done, left, static_cast<off_t>(offset + done));
+      },
+      length);
 }
 
 int ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst) {
@@ -111,7 +105,7 @@ int ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst)
     OPENSSL_cleanse(scratch, length);
     std::free(scratch);
   });
-  if (!MoveAll(::pread, image.fd, scratch, length, offset)) {
+  if (!MoveAt(::pread, image.fd, scratch, length, offset)) {
     return kIoError;
   }
   std::memcpy(dst, scratch, length);
@@ -139,7 +133,7 @@ int WriteImage(int device, std::uint32_t offset, std::uint32_t length, const voi
   if (!InRange(offset, length, 0, image.size)) {
     return kOutOfRange;
   }
-  if (!MoveAll(::pwrite, image.fd, static_cast<const std::uint8_t*>(src), length, offset)) {
+  if (!MoveAt(::pwrite, image.fd, static_cast<const std::uint8_t*>(src), length, offset)) {
     return kIoError;
   }
   if (::fdatasync(image.fd) != 0) {

@@ -10,25 +10,11 @@
 #include <cstdio>
 #include <cstring>
 
+#include "util/io.h"
+
 namespace keymgr {
 
 namespace {
-
-// WriteAll repeats write(2) until every byte is out.
-bool WriteAll(int fd, const std::uint8_t* bytes, std::size_t size) {
-  while (size > 0) {
-    ssize_t put = ::write(fd, bytes, size);
-    if (put < 0 && errno == EINTR) {
-      continue;
-    }
-    if (put <= 0) {
-      return false;
-    }
-    bytes += put;
-    size -= static_cast<std::size_t>(put);
-  }
-  return true;
-}
 
 // Filesystems without O_TMPFILE answer with one of these.
 bool NoAnonymousFiles(int error) {
@@ -109,7 +95,10 @@ void AtomicFile::Write(const void* bytes, std::size_t size) {
 }
 
 bool AtomicFile::Flush() {
-  if (!failed_ && !WriteAll(fd_, buffer_.data(), used_)) {
+  const auto write = [&](std::size_t done, std::size_t left) {
+    return ::write(fd_, buffer_.data() + done, left);
+  };
+  if (!failed_ && !MoveAll(write, used_)) {
     failed_ = true;
   }
   OPENSSL_cleanse(buffer_.data(), used_);

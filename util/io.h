@@ -1,0 +1,31 @@
+// A loop for system calls that may move fewer bytes than asked.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cerrno>
+#include <cstddef>
+
+namespace keymgr {
+
+// MoveAll calls |io(done, left)| until |size| bytes have moved, where |io|
+// moves up to |left| bytes after the first |done| and returns the count or
+// -1 with errno, like read(2). An interrupted call is repeated. Returns false
+// on an error, or when a call moves nothing (end of file).
+template <class Io>
+bool MoveAll(Io io, std::size_t size) {
+  std::size_t done = 0;
+  while (done < size) {
+    const ssize_t moved = io(done, size - done);
+    if (moved < 0 && errno == EINTR) {
+      continue;
+    }
+    if (moved <= 0) {
+      return false;
+    }
+    done += static_cast<std::size_t>(moved);
+  }
+  return true;
+}
+
+}  // namespace keymgr
