@@ -8,9 +8,10 @@
 #include <cstdio>
 #include <cstring>
 
-#include "cli/boot_status.h"
+#include "bootlog/boot_status.h"
 #include "integrity/manifest.h"
 #include "platform/eeprom.h"
+#include "platform/eeprom_map.h"
 #include "util/debug_print.h"
 
 namespace {
@@ -18,12 +19,7 @@ namespace {
 constexpr int kVersionMajor = 2;
 constexpr int kVersionMinor = 3;
 
-// The integrity-check control byte: mode field 2 together with the enable bit
-// turns the boot verification on.
-constexpr std::uint32_t kControlByteOffset = 5049;
-constexpr std::uint8_t kControlModeMask = 0x03;
-constexpr std::uint8_t kControlModeVerify = 0x02;
-constexpr std::uint8_t kControlEnableBit = 0x40;
+namespace eeprom = keymgr::eeprom;
 
 // Finish flushes what was printed so the boot script's capture is complete
 // before the status is seen.
@@ -35,10 +31,11 @@ int Finish(int status) {
 bool ControlByteEnablesVerification() {
   std::uint8_t control = 0;
   // A failed read stays silent: it just does not enable verification.
-  if (ReadEEPROM(0, kControlByteOffset, 1, &control) < 0) {
+  if (ReadEEPROM(eeprom::kDevice, eeprom::kControlByteOffset, 1, &control) < 0) {
     return false;
   }
-  return (control & kControlModeMask) == kControlModeVerify && (control & kControlEnableBit) != 0;
+  return (control & eeprom::kControlModeMask) == eeprom::kControlModeVerify &&
+         (control & eeprom::kControlEnableBit) != 0;
 }
 
 }  // namespace

@@ -7,10 +7,10 @@
 #include <cstring>
 #include <span>
 
-#include "cli/boot_status.h"
+#include "bootlog/boot_status.h"
+#include "crypto/file_digest.h"
 #include "util/atomic_file.h"
 #include "util/debug_print.h"
-#include "util/file_digest.h"
 #include "util/paths.h"
 #include "util/secure.h"
 
@@ -47,17 +47,12 @@ EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
 
 // HashEntry computes the digest of one entry and prints the failure line.
 bool HashEntry(const EntryBuffer& entry, Digest& digest) {
-  switch (keymgr::ComputeFileDigest(entry.data(), "r", digest)) {
-    case keymgr::FileDigestResult::kOk:
-      return true;
-    case keymgr::FileDigestResult::kStatusFailure:
-      DebugPrint("file[%s] status error!!\n", entry.data());
-      return false;
-    case keymgr::FileDigestResult::kOpenFailure:
-      DebugPrint("file[%s] open error!!\n", entry.data());
-      return false;
+  const keymgr::Status status = keymgr::ComputeFileDigest(entry.data(), "r", digest);
+  if (!status.ok()) {
+    DebugPrint(status.Is("stat") ? "file[%s] status error!!\n" : "file[%s] open error!!\n",
+               entry.data());
   }
-  return false;
+  return status.ok();
 }
 
 // ReadRecord reads the next digest record. Missing bytes stay zero, so a
@@ -132,7 +127,7 @@ int HashManifest() {
   // stay those of a file truncated first: empty when the manifest is missing,
   // the records before a failed entry otherwise.
   keymgr::AtomicFile digests;
-  if (!digests.Open(keymgr::kDigestFilePath, keymgr::kDigestFileMode)) {
+  if (!digests.Open(keymgr::kDigestFilePath, keymgr::kDigestFileMode).ok()) {
     PrintOpenError(keymgr::kDigestFilePath);
     return 1;
   }
@@ -148,7 +143,7 @@ int HashManifest() {
   }
   // A digest file that cannot be put in place fails like one that cannot be
   // opened.
-  if (!digests.Commit()) {
+  if (!digests.Commit().ok()) {
     PrintOpenError(keymgr::kDigestFilePath);
     result = 1;
   }

@@ -14,11 +14,10 @@ int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int s
   std::uint32_t digestLength = kDigestSize;
   std::array<std::uint8_t, kDigestSize> digestArea{};
   ProtectedKey digestKey;
-  ProtectedKey_Attach(&digestKey, 0, digestArea.data());
-  ProtectedKey_SetLength(&digestKey, kDigestSize);
+  Bind(&digestKey, digestArea.data(), kDigestSize);
 
-  ContainerScope container(VKT_DTC_CreateCryptoContainer());
-  if (container.get() == nullptr) {
+  Container container(VKT_DTC_CreateCryptoContainer());
+  if (!container) {
     // Creation reports no code; the line shows the result so far, 0.
     DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
     return 1;
@@ -39,7 +38,8 @@ int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int s
   }
 
   if (store != 0) {
-    if (WriteEEPROM_Bytes_Sema(0, kScDigestOffset, kDigestSize, digest) < 0) {
+    if (WriteEEPROM_Bytes_Sema(keymgr::eeprom::kDevice, keymgr::eeprom::kScDigestOffset,
+                               kDigestSize, digest) < 0) {
       DebugPrint("Write error - Message Digest to EEPROM !!!\n");
       return 1;
     }
@@ -51,7 +51,7 @@ int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int s
       return 1;
     }
   }
-  container.Destroy();
+  container.reset();
   DebugPrint("SC Digest is created!!\n");
   return 0;
 }

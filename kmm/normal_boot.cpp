@@ -5,7 +5,7 @@
 #include <cstring>
 #include <ctime>
 
-#include "cli/boot_status.h"
+#include "bootlog/boot_status.h"
 #include "kmm/internal.h"
 #include "util/debug_print.h"
 
@@ -81,8 +81,7 @@ int NormalBoot(KeyContext* context, int logFlag) {
   }
 
   context->storeKeyLength = length;
-  ProtectedKey_Attach(&context->storeKeyPK, 0, context->storeKeyBytes);
-  ProtectedKey_SetLength(&context->storeKeyPK, context->storeKeyLength);
+  Bind(&context->storeKeyPK, context->storeKeyBytes, context->storeKeyLength);
   if (DecryptStoreKey(context) != 0) {
     DebugPrint("Decrypt Store Key Error!!\n");
     return fail();

@@ -71,8 +71,8 @@ int GenerateSeedKey(KeyContext* context) {
   std::memcpy(seed.seedRandom, random.data(), sizeof(seed.seedRandom));
 
   context->seedKeyLength = kSeedKeySize;
-  ProtectedKey_Attach(&context->seedKeyPK, 0, reinterpret_cast<std::uint8_t*>(&context->seedKey));
-  ProtectedKey_SetLength(&context->seedKeyPK, context->seedKeyLength);
+  Bind(&context->seedKeyPK, reinterpret_cast<std::uint8_t*>(&context->seedKey),
+       context->seedKeyLength);
   DebugPrint("Seed Key is created!!\n");
   return 0;
 }
@@ -80,10 +80,10 @@ int GenerateSeedKey(KeyContext* context) {
 int GenerateSecretKey(KeyContext* context) {
   std::uint32_t result = 0;
   context->secretKeyLength = kSecretKeySize;  // capacity going in
-  ProtectedKey_Attach(&context->secretKeyPK, 0, context->secretKeyBytes);
+  Attach(&context->secretKeyPK, context->secretKeyBytes);
 
-  ContainerScope container(VKT_DTC_CreateCryptoContainer());
-  if (container.get() == nullptr) {
+  Container container(VKT_DTC_CreateCryptoContainer());
+  if (!container) {
     // Creation reports no code; the line shows the result so far, 0.
     DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
     return 1;
@@ -99,8 +99,8 @@ int GenerateSecretKey(KeyContext* context) {
     return 1;
   }
   // The sealing later in this regeneration uses this reference as it is.
-  VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
-  container.Destroy();
+  FetchConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
+  container.reset();
   DebugPrint("Secret Key is created!!\n");
   return 0;
 }

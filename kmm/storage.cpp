@@ -12,10 +12,7 @@
 
 using namespace keymgr::kmm;
 
-namespace {
-// The first argument of every EEPROM call: the device's EEPROM.
-constexpr int kEepromDevice = 0;
-}  // namespace
+namespace eeprom = keymgr::eeprom;
 
 int ReadStoreKey(std::uint32_t* length, std::uint8_t* dst) {
   if (dst == nullptr) {
@@ -23,7 +20,8 @@ int ReadStoreKey(std::uint32_t* length, std::uint8_t* dst) {
     return 1;
   }
   std::array<std::uint8_t, kSealedKeySize> buffer{};
-  int result = ReadEEPROM_msok(kEepromDevice, kStoreKeyOffset, kSealedKeySize, buffer.data());
+  int result =
+      ReadEEPROM_msok(eeprom::kDevice, eeprom::kStoreKeyOffset, kSealedKeySize, buffer.data());
   if (result < 0) {
     DebugPrint("Read Error [%d] - Store Key from EEPROM !!!\n", result);
     return 1;
@@ -41,8 +39,8 @@ int WriteStoreKey(std::uint32_t /*length*/, const std::uint8_t* src) {
   // The store key always fills its whole region, whatever length is claimed.
   std::array<std::uint8_t, kSealedKeySize> buffer{};
   std::memcpy(buffer.data(), src, buffer.size());
-  int result = WriteSectionEEPROM(kEepromDevice, kStoreKeyOffset, kSealedKeySize, buffer.data(),
-                                  kStoreKeySectionStart, kStoreKeySectionLength);
+  int result = WriteSectionEEPROM(eeprom::kDevice, eeprom::kStoreKeyOffset, kSealedKeySize,
+                                  buffer.data(), eeprom::kSectionStart, eeprom::kSectionLength);
   if (result < 0) {
     DebugPrint("Write Error [%d] - Store Key to EEPROM !!!\n", result);
     return 1;
@@ -51,7 +49,7 @@ int WriteStoreKey(std::uint32_t /*length*/, const std::uint8_t* src) {
 }
 
 int ReadDigestEEPROM(std::uint8_t* dst) {
-  if (ReadEEPROM_msok(kEepromDevice, kScDigestOffset, kDigestSize, dst) < 0) {
+  if (ReadEEPROM_msok(eeprom::kDevice, eeprom::kScDigestOffset, kDigestSize, dst) < 0) {
     DebugPrint("Read Error - Message Digest from EEPROM !!!\n");
     return 1;
   }
@@ -60,7 +58,8 @@ int ReadDigestEEPROM(std::uint8_t* dst) {
 
 int WriteDigestHDD(const std::uint8_t* digest) {
   // Replaced whole, so a crash never leaves a torn copy beside the EEPROM's.
-  if (!keymgr::ReplaceFile(keymgr::kScDigestPath, digest, kDigestSize, keymgr::kSecretFileMode)) {
+  if (!keymgr::ReplaceFile(keymgr::kScDigestPath, digest, kDigestSize, keymgr::kSecretFileMode)
+           .ok()) {
     DebugPrint("%s open error!!!\n", keymgr::kScDigestPath);
     return 1;
   }

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "crypto/hash.h"
 #include "keymgr_build_config.h"
 #include "kmm/internal.h"
 #include "platform/pcp.h"
@@ -28,7 +29,8 @@ using TpmSecretHex = SecretText<kTpmSecretHexSize>;
 // HexOf writes the hex text of a TPM identity or password. Both sizes are
 // fixed, so it cannot fail.
 void HexOf(const TpmSecret& bytes, TpmSecretHex& text) {
-  BytesToHex(bytes.data(), kTpmSecretSize, text.data(), kTpmSecretHexSize);
+  static_assert(kTpmSecretHexSize == 2 * kTpmSecretSize + 1);
+  (void)BytesToHex(bytes.data(), kTpmSecretSize, text.data(), kTpmSecretHexSize);
 }
 
 // ReadKeyFile reads up to |size| bytes of |path| into |dst| and returns false
@@ -48,7 +50,7 @@ bool ReadKeyFile(const char* path, std::uint8_t* dst, std::size_t size) {
 // success line follows only once the new file is durably in place, and a
 // failure leaves the old file whole.
 bool WriteKeyFile(const char* path, const char* name, const std::uint8_t* src, std::size_t size) {
-  if (!keymgr::ReplaceFile(path, src, size, keymgr::kSecretFileMode)) {
+  if (!keymgr::ReplaceFile(path, src, size, keymgr::kSecretFileMode).ok()) {
     DebugPrint("Failed to open %s\n", name);
     return false;
   }
@@ -60,16 +62,15 @@ bool WriteKeyFile(const char* path, const char* name, const std::uint8_t* src, s
 // constant to it.
 void BindOneOffKey(KeyContext* context, const Secret<kOneOffKeySize>& ook) {
   std::memcpy(context->oneOffKey, ook.data(), kOneOffKeySize);
-  ProtectedKey_Attach(context->oneOffKeyRef, 0, context->oneOffKey);
-  ProtectedKey_SetLength(context->oneOffKeyRef, context->oneOffKeyRefLength);
+  Bind(context->oneOffKeyRef, context->oneOffKey, context->oneOffKeyRefLength);
 }
 
 // RunAes runs one AES job over 48 bytes from |in| to |out| under the bound
 // OOK and the AES parameter constant. Returns 0, or 1 with a message.
 int RunAes(KeyContext* context, std::uint32_t direction, const ProtectedKey* in, ProtectedKey* out,
            std::uint32_t* outLength) {
-  ContainerScope container(VKT_DTC_CreateCryptoContainer());
-  if (container.get() == nullptr) {
+  Container container(VKT_DTC_CreateCryptoContainer());
+  if (!container) {
     DebugPrint("VKT_DTC_CreateCryptoContainer Failed.\n");
     return 1;
   }
@@ -86,7 +87,7 @@ int RunAes(KeyContext* context, std::uint32_t direction, const ProtectedKey* in,
     DebugPrint("DTC_AES Failed.\n");
     return 1;
   }
-  container.Destroy();
+  container.reset();
   return 0;
 }
 
@@ -176,9 +177,9 @@ int GenerateStoreKey(KeyContext* context) {
     return 1;
   }
 
-  VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
+  FetchConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
   BindOneOffKey(context, ook);
-  ProtectedKey_Attach(&context->storeKeyPK, 0, context->storeKeyBytes);
+  Attach(&context->storeKeyPK, context->storeKeyBytes);
   // All 48 bytes of the secret-key area are sealed: the secret key and the
   // 16 bytes after it.
   if (RunAes(context, DTC_AES_ENCRYPT, &context->secretKeyPK, &context->storeKeyPK,
@@ -200,7 +201,7 @@ int DecryptStoreKey(KeyContext* context) {
   // Cleared so that a short file leaves defined bytes behind what it held.
   std::array<std::uint8_t, kStoredOokSize> storedOok{};
 
-  VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
+  FetchConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
   // Without the identity file the OOK is not unsealed and the AES step runs
   // with the key record as the crypto services hold it.
   if (ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize)) {
@@ -233,8 +234,8 @@ int DecryptStoreKey(KeyContext* context) {
     BindOneOffKey(context, ook);
   }
 
-  VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
-  ProtectedKey_Attach(&context->secretKeyPK, 0, context->secretKeyBytes);
+  FetchConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
+  Attach(&context->secretKeyPK, context->secretKeyBytes);
   if (RunAes(context, DTC_AES_DECRYPT, &context->storeKeyPK, &context->secretKeyPK,
              &context->secretKeyLength) != 0) {
     return 1;

@@ -9,57 +9,55 @@
 #include <cerrno>
 #include <climits>
 #include <cstdint>
-#include <cstdlib>
 #include <cstring>
+#include <vector>
 
+#include "platform/eeprom_map.h"
 #include "util/io.h"
+#include "util/owned.h"
 #include "util/paths.h"
 #include "util/secure.h"
+#include "util/status.h"
 
 namespace {
 
-// Failure codes, all negative so callers test only the sign.
-constexpr int kBadArgument = -EINVAL;
-constexpr int kNoDevice = -ENODEV;
-constexpr int kOutOfRange = -ERANGE;
-constexpr int kIoError = -EIO;
+using keymgr::ErrnoFailure;
+using keymgr::Status;
 
-// Image is an open EEPROM image; the descriptor is closed on every path.
+// Image is an open EEPROM image.
 struct Image {
-  int fd = -1;
+  keymgr::Descriptor fd;
   std::uint64_t size = 0;
-  ~Image() {
-    if (fd >= 0) {
-      ::close(fd);
-    }
-  }
 };
 
 // OpenImage opens the image without blocking on a special file and accepts
-// only a regular file. Returns 0 or a negative failure code.
-int OpenImage(int flags, Image& image) {
-  image.fd = ::open(keymgr::kEepromPath, flags | O_NONBLOCK | O_CLOEXEC);
-  if (image.fd < 0) {
-    return errno != 0 ? -errno : kIoError;
+// only a regular file.
+Status OpenImage(int flags, Image& image) {
+  image.fd.reset(::open(keymgr::kEepromPath, flags | O_NONBLOCK | O_CLOEXEC));
+  if (!image.fd) {
+    return ErrnoFailure("open");
   }
   struct stat st {};
-  if (::fstat(image.fd, &st) != 0 || !S_ISREG(st.st_mode) || st.st_size < 0) {
-    return kNoDevice;
+  if (::fstat(image.fd.get(), &st) != 0) {
+    return ErrnoFailure("fstat");
+  }
+  if (!S_ISREG(st.st_mode) || st.st_size < 0) {
+    return ErrnoFailure("open", ENODEV);
   }
   image.size = static_cast<std::uint64_t>(st.st_size);
-  return 0;
+  return Status();
 }
 
 // CheckRequest rejects another device, a missing buffer and a length that
 // does not fit the int result.
-int CheckRequest(int device, std::uint32_t length, const void* buffer) {
-  if (device != 0) {
-    return kNoDevice;
+Status CheckRequest(int device, std::uint32_t length, const void* buffer) {
+  if (device != keymgr::eeprom::kDevice) {
+    return ErrnoFailure("device", ENODEV);
   }
   if ((buffer == nullptr && length != 0) || length > static_cast<std::uint32_t>(INT_MAX)) {
-    return kBadArgument;
+    return ErrnoFailure("length", EINVAL);
   }
-  return 0;
+  return Status();
 }
 
 // InRange tells whether [offset, offset+length) lies inside [start,
@@ -69,97 +67,100 @@ bool InRange(std::uint64_t offset, std::uint64_t length, std::uint64_t start, st
 }
 
 // MoveAt repeats |io| (pread or pwrite) until |length| bytes have moved at
-// |offset|; false on an error or an image that ends early.
+// |offset|; fails on an error or an image that ends early.
 template <class Io, class Byte>
-bool MoveAt(Io io, int fd, Byte* bytes, std::uint32_t length, std::uint32_t offset) {
-  return keymgr::MoveAll(
-      [&](std::size_t done, std::size_t left) {
-        return io(fd, bytes + done, left, static_cast<off_t>(offset + done));
-      },
-      length);
+Status MoveAt(Io io, const char* call, int fd, Byte* bytes, std::uint32_t length,
+              std::uint32_t offset) {
+  errno = EIO;  // what an image that ends early reports
+  const auto step = [&](std::size_t done, std::size_t left) {
+    return io(fd, bytes + done, left, static_cast<off_t>(offset + done));
+  };
+  return keymgr::MoveAll(step, length) ? Status() : ErrnoFailure(call);
 }
 
-int ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst) {
-  int check = CheckRequest(device, length, dst);
-  if (check < 0) {
-    return check;
+Status ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst) {
+  if (Status status = CheckRequest(device, length, dst); !status.ok()) {
+    return status;
   }
   Image image;
-  int opened = OpenImage(O_RDONLY, image);
-  if (opened < 0) {
-    return opened;
+  if (Status status = OpenImage(O_RDONLY, image); !status.ok()) {
+    return status;
   }
   if (!InRange(offset, length, 0, image.size)) {
-    return kOutOfRange;
+    return ErrnoFailure("range", ERANGE);
   }
   if (length == 0) {
-    return 0;
+    return Status();
   }
   // Read into a scratch buffer so a failed read leaves |dst| untouched; the
   // bytes may be key material, so the scratch copy is wiped.
-  auto* scratch = static_cast<std::uint8_t*>(std::malloc(length));
-  if (scratch == nullptr) {
-    return -ENOMEM;
+  std::vector<std::uint8_t> scratch(length);
+  keymgr::ScopeExit wipe([&] { OPENSSL_cleanse(scratch.data(), scratch.size()); });
+  if (Status status = MoveAt(::pread, "pread", image.fd.get(), scratch.data(), length, offset);
+      !status.ok()) {
+    return status;
   }
-  keymgr::ScopeExit release([&] {
-    OPENSSL_cleanse(scratch, length);
-    std::free(scratch);
-  });
-  if (!MoveAt(::pread, image.fd, scratch, length, offset)) {
-    return kIoError;
-  }
-  std::memcpy(dst, scratch, length);
-  return static_cast<int>(length);
+  std::memcpy(dst, scratch.data(), length);
+  return Status();
 }
 
-int WriteImage(int device, std::uint32_t offset, std::uint32_t length, const void* src, bool lock) {
-  int check = CheckRequest(device, length, src);
-  if (check < 0) {
-    return check;
+Status WriteImage(int device, std::uint32_t offset, std::uint32_t length, const void* src,
+                  bool lock) {
+  if (Status status = CheckRequest(device, length, src); !status.ok()) {
+    return status;
   }
   Image image;
-  int opened = OpenImage(O_WRONLY, image);
-  if (opened < 0) {
-    return opened;
+  if (Status status = OpenImage(O_WRONLY, image); !status.ok()) {
+    return status;
   }
   // The lock is released when the descriptor closes.
-  if (lock) {
-    while (::flock(image.fd, LOCK_EX) != 0) {
-      if (errno != EINTR) {
-        return kIoError;
-      }
+  while (lock && ::flock(image.fd.get(), LOCK_EX) != 0) {
+    if (errno != EINTR) {
+      return ErrnoFailure("flock");
     }
   }
   if (!InRange(offset, length, 0, image.size)) {
-    return kOutOfRange;
+    return ErrnoFailure("range", ERANGE);
   }
-  if (!MoveAt(::pwrite, image.fd, static_cast<const std::uint8_t*>(src), length, offset)) {
-    return kIoError;
+  const auto* bytes = static_cast<const std::uint8_t*>(src);
+  if (Status status = MoveAt(::pwrite, "pwrite", image.fd.get(), bytes, length, offset);
+      !status.ok()) {
+    return status;
   }
-  if (::fdatasync(image.fd) != 0) {
-    return kIoError;
+  if (::fdatasync(image.fd.get()) != 0) {
+    return ErrnoFailure("fdatasync");
   }
-  return static_cast<int>(length);
+  return Status();
+}
+
+// Result reduces a status to the library's result: the number of bytes
+// moved, or the negative errno of the failure.
+int Result(const Status& status, std::uint32_t length) {
+  if (status.ok()) {
+    return static_cast<int>(length);
+  }
+  const int error = status.origin() == keymgr::Origin::kErrno ? static_cast<int>(status.code()) : 0;
+  return error > 0 ? -error : -EIO;
 }
 
 }  // namespace
 
 int ReadEEPROM(int device, uint32_t offset, uint32_t length, void* dst) {
-  return ReadImage(device, offset, length, dst);
+  return Result(ReadImage(device, offset, length, dst), length);
 }
 
 int ReadEEPROM_msok(int device, uint32_t offset, uint32_t length, void* dst) {
-  return ReadImage(device, offset, length, dst);
+  return Result(ReadImage(device, offset, length, dst), length);
 }
 
 int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length, const void* src,
                        uint32_t sectionStart, uint32_t sectionLength) {
   if (!InRange(offset, length, sectionStart, sectionLength)) {
-    return device != 0 ? kNoDevice : kOutOfRange;
+    return device != keymgr::eeprom::kDevice ? -ENODEV : -ERANGE;
   }
-  return WriteImage(device, offset, length, src, false);
+  return Result(WriteImage(device, offset, length, src, false), length);
 }
 
 int WriteEEPROM_Bytes_Sema(int device, uint32_t offset, uint32_t length, const void* src) {
-  return WriteImage(device, offset, length, src, true);
+  return Result(WriteImage(device, offset, length, src, true), length);
 }

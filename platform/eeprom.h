@@ -7,17 +7,22 @@
 #include <stdint.h>
 
 #ifdef __cplusplus
+#define EEPROM_NODISCARD [[nodiscard]]
 extern "C" {
+#else
+#define EEPROM_NODISCARD
 #endif
 
-int ReadEEPROM(int device, uint32_t offset, uint32_t length, void* dst);
-int ReadEEPROM_msok(int device, uint32_t offset, uint32_t length, void* dst);
+EEPROM_NODISCARD int ReadEEPROM(int device, uint32_t offset, uint32_t length, void* dst);
+EEPROM_NODISCARD int ReadEEPROM_msok(int device, uint32_t offset, uint32_t length, void* dst);
 // WriteSectionEEPROM also fails when [offset, offset+length) does not lie
 // inside the section [sectionStart, sectionStart+sectionLength).
-int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length, const void* src,
-                       uint32_t sectionStart, uint32_t sectionLength);
+EEPROM_NODISCARD int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length,
+                                        const void* src, uint32_t sectionStart,
+                                        uint32_t sectionLength);
 // WriteEEPROM_Bytes_Sema holds an exclusive lock on the image while it writes.
-int WriteEEPROM_Bytes_Sema(int device, uint32_t offset, uint32_t length, const void* src);
+EEPROM_NODISCARD int WriteEEPROM_Bytes_Sema(int device, uint32_t offset, uint32_t length,
+                                            const void* src);
 
 #ifdef __cplusplus
 }

@@ -15,13 +15,14 @@
 #include <cstring>
 
 #include "platform/eeprom.h"
+#include "platform/eeprom_map.h"
 #include "util/bytes.h"
 #include "util/paths.h"
 #include "util/secure.h"
 
 namespace {
 
-constexpr std::size_t kImageSize = 32768;
+constexpr std::size_t kImageSize = keymgr::eeprom::kSize;
 constexpr int kErrorStatus = 1;
 
 int Fail(const char* what) {

@@ -6,6 +6,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -27,63 +28,56 @@ AtomicFile::~AtomicFile() {
   Discard();
 }
 
-bool AtomicFile::Open(const char* path, mode_t mode) {
+Status AtomicFile::Open(const char* path, mode_t mode) {
   Discard();
-  failed_ = false;
-  used_ = 0;
+  failed_ = Status();
   const std::size_t length = std::strlen(path);
   // The temporary name adds a dot and a seven-character suffix to the base.
   if (length == 0 || length + 9 > path_.size()) {
-    errno = ENAMETOOLONG;
-    return false;
+    return ErrnoFailure("open", ENAMETOOLONG);
   }
   std::memcpy(path_.data(), path, length + 1);
   char* slash = std::strrchr(path_.data(), '/');
   base_ = slash != nullptr ? slash + 1 : path_.data();
   if (*base_ == '\0') {
-    errno = EISDIR;
-    return false;
+    return ErrnoFailure("open", EISDIR);
   }
-  {
-    // The folder, as a path of its own for open(2) and mkostemp(3).
-    std::array<char, kNameSize> dir{};
-    if (slash == nullptr) {
-      dir[0] = '.';
-    } else {
-      std::memcpy(dir.data(), path_.data(), slash == path_.data() ? 1 : slash - path_.data());
-    }
-    dirFd_ = ::open(dir.data(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dirFd_ < 0) {
-      return false;
-    }
-    // An unnamed file disappears by itself if the process dies before
-    // Commit, so a crash never leaves a partial file in the folder.
-    fd_ = ::openat(dirFd_, ".", O_TMPFILE | O_WRONLY | O_CLOEXEC, mode);
-    anonymous_ = fd_ >= 0;
-    if (fd_ < 0 && NoAnonymousFiles(errno)) {
-      std::array<char, kNameSize> templ{};
-      std::snprintf(templ.data(), templ.size(), "%s/.%s.XXXXXX", dir.data(), base_);
-      fd_ = ::mkostemp(templ.data(), O_CLOEXEC);
-      if (fd_ >= 0) {
-        std::snprintf(tempPath_.data(), tempPath_.size(), "%s",
-                      std::strrchr(templ.data(), '/') + 1);
-      }
+  // The folder, as a path of its own for open(2) and mkostemp(3).
+  std::array<char, kNameSize> dir{};
+  if (slash == nullptr) {
+    dir[0] = '.';
+  } else {
+    std::memcpy(dir.data(), path_.data(), slash == path_.data() ? 1 : slash - path_.data());
+  }
+  dirFd_.reset(::open(dir.data(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dirFd_) {
+    return ErrnoFailure("open");
+  }
+  // An unnamed file disappears by itself if the process dies before Commit,
+  // so a crash never leaves a partial file in the folder.
+  fd_.reset(::openat(dirFd_.get(), ".", O_TMPFILE | O_WRONLY | O_CLOEXEC, mode));
+  anonymous_ = static_cast<bool>(fd_);
+  if (!fd_ && NoAnonymousFiles(errno)) {
+    std::array<char, kNameSize> templ{};
+    std::snprintf(templ.data(), templ.size(), "%s/.%s.XXXXXX", dir.data(), base_);
+    fd_.reset(::mkostemp(templ.data(), O_CLOEXEC));
+    if (fd_) {
+      std::snprintf(tempPath_.data(), tempPath_.size(), "%s", std::strrchr(templ.data(), '/') + 1);
     }
   }
   // The umask must not widen or narrow the mode of a key file.
-  if (fd_ < 0 || ::fchmod(fd_, mode) != 0) {
-    const int saved = errno;
+  if (!fd_ || ::fchmod(fd_.get(), mode) != 0) {
+    Status failed = ErrnoFailure(fd_ ? "fchmod" : "open");
     Discard();
-    errno = saved;
-    return false;
+    return failed;
   }
-  return true;
+  return Status();
 }
 
 void AtomicFile::Write(const void* bytes, std::size_t size) {
   const auto* in = static_cast<const std::uint8_t*>(bytes);
-  while (!failed_ && size > 0) {
-    if (used_ == buffer_.size() && !Flush()) {
+  while (failed_.ok() && size > 0) {
+    if (used_ == buffer_.size() && !Flush().ok()) {
       return;
     }
     const std::size_t take = std::min(size, buffer_.size() - used_);
@@ -94,75 +88,80 @@ void AtomicFile::Write(const void* bytes, std::size_t size) {
   }
 }
 
-bool AtomicFile::Flush() {
+Status AtomicFile::Flush() {
   const auto write = [&](std::size_t done, std::size_t left) {
-    return ::write(fd_, buffer_.data() + done, left);
+    return ::write(fd_.get(), buffer_.data() + done, left);
   };
-  if (!failed_ && !MoveAll(write, used_)) {
-    failed_ = true;
+  if (failed_.ok() && !MoveAll(write, used_)) {
+    failed_ = ErrnoFailure("write");
   }
   OPENSSL_cleanse(buffer_.data(), used_);
   used_ = 0;
-  return !failed_;
+  return failed_;
 }
 
 // Link gives the unnamed file a temporary name beside |path|. A stale name
 // from an earlier crash between link and rename is replaced.
-bool AtomicFile::Link() {
+Status AtomicFile::Link() {
   std::snprintf(tempPath_.data(), tempPath_.size(), ".%s.new", base_);
-  if (::unlinkat(dirFd_, tempPath_.data(), 0) != 0 && errno != ENOENT) {
+  if (::unlinkat(dirFd_.get(), tempPath_.data(), 0) != 0 && errno != ENOENT) {
     tempPath_[0] = '\0';
-    return false;
+    return ErrnoFailure("unlinkat");
   }
-  if (::linkat(fd_, "", dirFd_, tempPath_.data(), AT_EMPTY_PATH) == 0) {
-    return true;
+  if (::linkat(fd_.get(), "", dirFd_.get(), tempPath_.data(), AT_EMPTY_PATH) == 0) {
+    return Status();
   }
   // Without CAP_DAC_READ_SEARCH the descriptor is linked through /proc.
   char self[32];
-  std::snprintf(self, sizeof(self), "/proc/self/fd/%d", fd_);
-  if (::linkat(AT_FDCWD, self, dirFd_, tempPath_.data(), AT_SYMLINK_FOLLOW) == 0) {
-    return true;
+  std::snprintf(self, sizeof(self), "/proc/self/fd/%d", fd_.get());
+  if (::linkat(AT_FDCWD, self, dirFd_.get(), tempPath_.data(), AT_SYMLINK_FOLLOW) == 0) {
+    return Status();
   }
   tempPath_[0] = '\0';
-  return false;
+  return ErrnoFailure("linkat");
 }
 
-bool AtomicFile::Commit() {
-  if (fd_ < 0) {
-    return false;
+Status AtomicFile::Commit() {
+  if (!fd_) {
+    return ErrnoFailure("write", EBADF);
   }
-  const bool done = Flush() && ::fsync(fd_) == 0 && (!anonymous_ || Link()) &&
-                    ::renameat(dirFd_, tempPath_.data(), dirFd_, base_) == 0;
-  if (done) {
-    tempPath_[0] = '\0';  // it is |path| now
+  Status status = Flush();
+  if (status.ok() && ::fsync(fd_.get()) != 0) {
+    status = ErrnoFailure("fsync");
   }
-  // The rename is durable only once the folder is.
-  const bool durable = done && ::fsync(dirFd_) == 0;
+  if (status.ok() && anonymous_) {
+    status = Link();
+  }
+  if (status.ok()) {
+    if (::renameat(dirFd_.get(), tempPath_.data(), dirFd_.get(), base_) != 0) {
+      status = ErrnoFailure("renameat");
+    } else {
+      tempPath_[0] = '\0';  // it is |path| now
+      // The rename is durable only once the folder is.
+      if (::fsync(dirFd_.get()) != 0) {
+        status = ErrnoFailure("fsync");
+      }
+    }
+  }
   Discard();
-  return durable;
+  return status;
 }
 
 void AtomicFile::Discard() {
-  if (tempPath_[0] != '\0' && dirFd_ >= 0) {
-    ::unlinkat(dirFd_, tempPath_.data(), 0);
+  if (tempPath_[0] != '\0' && dirFd_) {
+    ::unlinkat(dirFd_.get(), tempPath_.data(), 0);
   }
   tempPath_[0] = '\0';
-  if (fd_ >= 0) {
-    ::close(fd_);
-    fd_ = -1;
-  }
-  if (dirFd_ >= 0) {
-    ::close(dirFd_);
-    dirFd_ = -1;
-  }
+  fd_.reset();
+  dirFd_.reset();
   OPENSSL_cleanse(buffer_.data(), buffer_.size());
   used_ = 0;
 }
 
-bool ReplaceFile(const char* path, const void* bytes, std::size_t size, mode_t mode) {
+Status ReplaceFile(const char* path, const void* bytes, std::size_t size, mode_t mode) {
   AtomicFile file;
-  if (!file.Open(path, mode)) {
-    return false;
+  if (Status opened = file.Open(path, mode); !opened.ok()) {
+    return opened;
   }
   file.Write(bytes, size);
   return file.Commit();

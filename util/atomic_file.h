@@ -8,6 +8,9 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "util/owned.h"
+#include "util/status.h"
+
 namespace keymgr {
 
 // AtomicFile builds the new contents of |path| in an unnamed file of the same
@@ -26,24 +29,24 @@ class AtomicFile {
   AtomicFile(const AtomicFile&) = delete;
   AtomicFile& operator=(const AtomicFile&) = delete;
 
-  // Open returns false, with errno set, when the new file cannot be created
-  // (for example the folder is missing).
-  [[nodiscard]] bool Open(const char* path, mode_t mode);
+  // Open fails when the new file cannot be created (for example the folder
+  // is missing).
+  Status Open(const char* path, mode_t mode);
   void Write(const void* bytes, std::size_t size);
-  // Commit returns true once the new contents are durably at |path|.
-  [[nodiscard]] bool Commit();
+  // Commit succeeds once the new contents are durably at |path|.
+  Status Commit();
 
  private:
-  bool Flush();
-  bool Link();
+  Status Flush();
+  Status Link();
   void Discard();
 
   // Room for a fixed path of the system and the temporary name beside it.
   static constexpr std::size_t kNameSize = 160;
-  int fd_ = -1;
-  int dirFd_ = -1;
+  Descriptor fd_;
+  Descriptor dirFd_;
   bool anonymous_ = false;  // O_TMPFILE: no name until Link()
-  bool failed_ = false;
+  Status failed_;           // the first failed write, kept until Commit
   std::array<char, kNameSize> path_{};
   std::array<char, kNameSize> tempPath_{};
   const char* base_ = nullptr;  // the last component of path_
@@ -51,8 +54,8 @@ class AtomicFile {
   std::array<std::uint8_t, 4096> buffer_{};
 };
 
-// ReplaceFile puts |size| bytes at |path| as one AtomicFile. Returns false,
-// leaving |path| as it was, when that cannot be done durably.
-[[nodiscard]] bool ReplaceFile(const char* path, const void* bytes, std::size_t size, mode_t mode);
+// ReplaceFile puts |size| bytes at |path| as one AtomicFile. On failure
+// |path| is left as it was.
+Status ReplaceFile(const char* path, const void* bytes, std::size_t size, mode_t mode);
 
 }  // namespace keymgr

@@ -1,7 +1,5 @@
 #include "util/bytes.h"
 
-#include <openssl/md5.h>
-
 #include <cstring>
 
 #include "util/debug_print.h"
@@ -42,14 +40,6 @@ void PrintArray(const std::uint8_t* bytes, std::int32_t size) {
 
 void PrintRedactedArray(std::int32_t size) {
   PrintArrayLine(nullptr, size);
-}
-
-int Md5OfString(const char* text, std::uint8_t* digest) {
-  MD5_CTX ctx;
-  MD5_Init(&ctx);
-  MD5_Update(&ctx, text, std::strlen(text));
-  MD5_Final(digest, &ctx);
-  return 0;
 }
 
 int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize) {

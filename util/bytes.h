@@ -16,14 +16,11 @@ void PrintArray(const std::uint8_t* bytes, std::int32_t size);
 // byte shown as "**": the line keeps its shape and gives nothing away.
 void PrintRedactedArray(std::int32_t size);
 
-// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
-// bytes at |digest|. Always returns 0.
-int Md5OfString(const char* text, std::uint8_t* digest);
-
 // BytesToHex writes the upper-case hex text of |length| bytes of |src| and a
 // NUL into |dst|, which holds |dstSize| bytes. Returns 0, or -1 with a message
 // and |dst| untouched on a null pointer, a zero size or a short |dst|.
-int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize);
+[[nodiscard]] int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst,
+                             std::uint8_t dstSize);
 
 // HexDigitValue returns the value of one hexadecimal digit of either case,
 // or -1 for any other character.

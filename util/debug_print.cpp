@@ -2,10 +2,26 @@
 
 #include <cstdarg>
 #include <cstdio>
+#include <cstdlib>
 
 void DebugPrint(const char* format, ...) {
   va_list args;
   va_start(args, format);
   std::vprintf(format, args);
+  va_end(args);
+}
+
+bool DiagnosticsOn() {
+  static const bool on = std::getenv("KEYMGR_DEBUG") != nullptr;
+  return on;
+}
+
+void DiagnosticPrint(const char* format, ...) {
+  if (!DiagnosticsOn()) {
+    return;
+  }
+  va_list args;
+  va_start(args, format);
+  std::vfprintf(stderr, format, args);
   va_end(args);
 }

@@ -1,4 +1,4 @@
-// Small RAII helpers that close files and wipe secrets on every path.
+// Scope guards and secret buffers that wipe themselves on every path.
 #pragma once
 
 #include <openssl/crypto.h>
@@ -6,8 +6,6 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
-#include <cstdio>
-#include <memory>
 #include <utility>
 
 namespace keymgr {
@@ -53,15 +51,5 @@ struct SecretText {
   const char* c_str() const { return chars.data(); }
   static constexpr std::size_t size() { return N; }
 };
-
-struct FileCloser {
-  void operator()(std::FILE* f) const { std::fclose(f); }
-};
-// File closes its stream when it goes out of scope.
-using File = std::unique_ptr<std::FILE, FileCloser>;
-
-inline File OpenFile(const char* path, const char* mode) {
-  return File(std::fopen(path, mode));
-}
 
 }  // namespace keymgr

@@ -6,14 +6,28 @@
 
 #include <stdint.h>
 
-#include <kmm/dtc.h>
-
 #ifdef __cplusplus
 extern "C" {
 #endif
 
+/* The version of this interface: 2.3. */
+#define KMM_VERSION_MAJOR 2
+#define KMM_VERSION_MINOR 3
+
 #define KMM_OPTION_NORMAL_BOOT 1
 #define KMM_OPTION_REGENERATE 3
+
+/* ProtectedKey is the module's record over a run of key bytes held in an
+ * array of the context. Once the module has sized it, the array holds the
+ * bytes masked under a key of the process, never in plain form. The context
+ * holds three by value, so its layout is part of this interface, but a host
+ * treats the fields as opaque: it has no call that reads them. */
+typedef struct ProtectedKey {
+  uint8_t* bytes;  /* the attached array */
+  uint64_t nonce;  /* selects this record's mask stream */
+  uint32_t length; /* number of key bytes taken in */
+  uint32_t state;  /* attached / sized */
+} ProtectedKey;
 
 /* The seed key: local date text, calendar time, eight random words. */
 typedef struct KmmSeedKey {
@@ -23,7 +37,12 @@ typedef struct KmmSeedKey {
 } KmmSeedKey;
 
 /* KeyContext holds all key material of the module. There is one static
- * instance; KeyManage zeroes it on every call. */
+ * instance; KeyManage zeroes it on every call. What a host may rely on after
+ * a successful call: the lengths (seedKeyLength 44, secretKeyLength 32 after
+ * a regeneration and 48 after a normal boot, storeKeyLength 48) and
+ * statusWord. The key areas (oneOffKey, seedKey, secretKeyBytes,
+ * storeKeyBytes) are held masked by their records, or zero where the flow
+ * did not reach them: they never show key bytes in plain form. */
 typedef struct KeyContext {
   uint8_t oneOffKey[32];
   KmmSeedKey seedKey;
@@ -46,9 +65,9 @@ typedef struct KeyContext {
 /* KeyManage zeroes the module's context and runs |option|:
  * KMM_OPTION_NORMAL_BOOT proves the key material (recording DT=OK/DT=FAIL in
  * the boot status log when |logFlag| is non-zero), KMM_OPTION_REGENERATE
- * replaces it. Returns the context on success and NULL on failure or for any
- * other option. The contents are valid until the next call; the module is
- * not reentrant. */
+ * replaces it (call KmmSeedRandom first). Returns the context on success and
+ * NULL on failure or for any other option. The contents are valid until the
+ * next call; the module is not reentrant. */
 KeyContext* KeyManage(int32_t option, int logFlag);
 
 /* Sources that KmmSeedRandom reports. */

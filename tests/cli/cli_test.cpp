@@ -1,6 +1,5 @@
-// End-to-end runs of the built keymgr in the sandbox root, and the boot status
-// lines that follow the BN line.
-#include <openssl/sha.h>
+// End-to-end runs of the built keymgr in the sandbox root.
+#include <openssl/evp.h>
 #include <sys/stat.h>
 
 #include <gtest/gtest.h>
@@ -8,7 +7,6 @@
 #include <filesystem>
 #include <functional>
 
-#include "cli/boot_status.h"
 #include "keymgr_build_config.h"
 #include "support/sandbox.h"
 
@@ -23,31 +21,10 @@ const std::string kManifest = t::InRoot("/quorvan/hidden/keymgr.list");
 const std::string kOn = "SFE_003 - [4]\n", kOff = "SFE_003 - [0]\n";
 const std::string a = t::InRoot("/d/a"), b = t::InRoot("/d/b"), c = t::InRoot("/d/c");
 
-std::string Status(std::initializer_list<unsigned int> codes) {
-  testing::internal::CaptureStdout();
-  for (unsigned int code : codes) {
-    WriteBootStatus(code);
-  }
-  return testing::internal::GetCapturedStdout();
-}
-
-TEST(BootStatusTest, LaterLinesAreAppendedOnlyWithSfe003) {
-  t::ResetSandbox();
-  t::MakeEeprom(0x00, 4);
-  EXPECT_EQ(Status({2, 3, 4, 5, 0xFFFFFFFF}), kOn + "DT=OK\n" + kOn + "DT=FAIL\n" + kOn +
-                                                  "ST=OK\n" + kOn + "ST=FAIL\n" + kOn +
-                                                  "Unknown flag!!\n");
-  t::MakeEeprom(0x42, 0);
-  EXPECT_EQ(Status({3}), kOff);
-  EXPECT_EQ(t::ReadFile(kLog), "DT=OK\nDT=FAIL\nST=OK\nST=FAIL\n");
-  fs::remove_all(t::InRoot("/quorvan/spool"));
-  EXPECT_EQ(Status({1}), "file[" + kLog + "] open error!!\n");
-}
-
 std::string Sha(const std::string& text) {
   std::string digest(32, '\0');
-  SHA256(reinterpret_cast<const unsigned char*>(text.data()), text.size(),
-         reinterpret_cast<unsigned char*>(digest.data()));
+  EVP_Digest(text.data(), text.size(), reinterpret_cast<unsigned char*>(digest.data()), nullptr,
+             EVP_sha256(), nullptr);
   return digest;
 }
 
@@ -73,39 +50,42 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
   const std::string tooLong = "file[" + l99.substr(0, 40) + "...] name too long!!\n";
   const std::string aOpen = kOff + "file[" + a + "] open error!!\n" + fail;
   struct Case {
+    const char* name;
     std::vector<std::string> args;
     std::string out;
     std::function<void()> change = [] {};
     int status = 0;
     std::optional<std::string> digests = {};  // what hash leaves; others leave it alone
   } cases[] = {
-      {{K, "logall"}, first3 + Block(c, Z, Z) + "BN=OK\n"},
-      {{K, "fil"}, pass},
-      {{K, "-"}, pass},
-      {{K, "has"}, kOn + "BN=OK\n", [] { t::MakeEeprom(0x00, 4); }},
-      {{K}, kOff, [] { t::MakeEeprom(0x43, 0xFFFFFFFB); }},
-      {{K, "log"}, kOff, [] { t::MakeEeprom(0x02, 0); }},
-      {{K}, "Read Error [-2] - SFE CONF from EEPROM !!!\n", Put(KEYMGR_EEPROM_PATH)},
-      {{K, "-vx"}, "Version: 2.3\n"},
-      {{K, "file"}, ""},
-      {{K, "filecheck", b, "x"}, Block(b, B, B), Put(kDigests, E + B + Sha("x"))},
-      {{K, "file", "d/b"}, ""},
-      {{K, "file", b}, "file[" + b + "] status error!!\n", Put(b)},
-      {{K, "file", b}, kDigests + " open error!!!\n", Put(kDigests)},
-      {{K, "hashes"}, "", Put(kDigests), 0, records},
-      {{K, "hash"}, "file[" + b + "] status error!!\n", Put(b), 0, E},
-      {{K, "hash"}, kManifest + " open error!!!\n", Put(kManifest), 0, ""},
-      {{K, "hash"}, tooLong, Put(kManifest, l99 + " " + l99 + "z " + c), 0, Z},
-      {{K, "log"}, kOff + Block(a, E, E) + Block(b, Sha("altered"), B) + fail, Put(b, "altered")},
-      {{K}, kOff + "file[" + b + "] status error!!\n" + fail, Put(b)},
-      {{K, "log"}, first3 + Block(c, Z, std::string(32, '\0')) + fail, Put(kDigests, E + B + B)},
-      {{K}, pass, Put(kManifest, " \n\t")},
-      {{K, "log"}, kOff + kDigests + " open error!!!\n" + fail, Put(kDigests), 1},
-      {{K}, kOff + kManifest + " open error!!!\n" + fail, Put(kManifest), 1},
-      {{K}, kOff + tooLong + fail, Put(kManifest, l99 + "z")},
-      {{K}, aOpen, [] { fs::remove(a), mkfifo(a.c_str(), 0600); }},
-      {{K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
-      {{K}, aOpen, [] { fs::resize_file(a, (1ULL << 32) + 1); }},
+      // clang-format off
+      {"verbose verification by prefix", {K, "logall"}, first3 + Block(c, Z, Z) + "BN=OK\n"},
+      {"a word shorter than file", {K, "fil"}, pass},
+      {"a lone dash", {K, "-"}, pass},
+      {"SFE_003 alone opens the gate", {K, "has"}, kOn + "BN=OK\n", [] { t::MakeEeprom(0x00, 4); }},
+      {"mode 3 keeps the gate closed", {K}, kOff, [] { t::MakeEeprom(0x43, 0xFFFFFFFB); }},
+      {"the enable bit missing", {K, "log"}, kOff, [] { t::MakeEeprom(0x02, 0); }},
+      {"no EEPROM image", {K}, "Read Error [-2] - SFE CONF from EEPROM !!!\n", Put(KEYMGR_EEPROM_PATH)},
+      {"version by prefix", {K, "-vx"}, "Version: 2.3\n"},
+      {"file without a path", {K, "file"}, ""},
+      {"file by prefix", {K, "filecheck", b, "x"}, Block(b, B, B), Put(kDigests, E + B + Sha("x"))},
+      {"file by another spelling", {K, "file", "d/b"}, ""},
+      {"file of a missing entry", {K, "file", b}, "file[" + b + "] status error!!\n", Put(b)},
+      {"file without a digest file", {K, "file", b}, kDigests + " open error!!!\n", Put(kDigests)},
+      {"hash by prefix", {K, "hashes"}, "", Put(kDigests), 0, records},
+      {"hash stops at a missing entry", {K, "hash"}, "file[" + b + "] status error!!\n", Put(b), 0, E},
+      {"hash without a manifest", {K, "hash"}, kManifest + " open error!!!\n", Put(kManifest), 0, ""},
+      {"hash stops at an entry too long", {K, "hash"}, tooLong, Put(kManifest, l99 + " " + l99 + "z " + c), 0, Z},
+      {"a corrupted entry", {K, "log"}, kOff + Block(a, E, E) + Block(b, Sha("altered"), B) + fail, Put(b, "altered")},
+      {"a missing entry", {K}, kOff + "file[" + b + "] status error!!\n" + fail, Put(b)},
+      {"a short digest file", {K, "log"}, first3 + Block(c, Z, std::string(32, '\0')) + fail, Put(kDigests, E + B + B)},
+      {"an empty manifest", {K}, pass, Put(kManifest, " \n\t")},
+      {"no digest file", {K, "log"}, kOff + kDigests + " open error!!!\n" + fail, Put(kDigests), 1},
+      {"no manifest", {K}, kOff + kManifest + " open error!!!\n" + fail, Put(kManifest), 1},
+      {"an entry too long", {K}, kOff + tooLong + fail, Put(kManifest, l99 + "z")},
+      {"a FIFO listed", {K}, aOpen, [] { fs::remove(a), mkfifo(a.c_str(), 0600); }},
+      {"a file of 2 GiB", {K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
+      {"a file of 4 GiB and a byte", {K}, aOpen, [] { fs::resize_file(a, (1ULL << 32) + 1); }},
+      // clang-format on
   };
   const auto setUp = [&] {
     t::ResetSandbox();
@@ -117,6 +97,7 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
     t::WriteFile(kLog, "OLD\n");
   };
   for (const Case& k : cases) {
+    SCOPED_TRACE(k.name);
     setUp();
     k.change();
     const auto digests = t::ReadFile(kDigests);

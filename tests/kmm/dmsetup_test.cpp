@@ -1,10 +1,10 @@
 // The disk-mapper tool check: in process against an expected digest swapped
 // in for the built-in one, and end to end through kmm-host.
 #include <gtest/gtest.h>
-#include <kmm/dtc.h>
 #include <kmm/kmm.h>
 #include <openssl/evp.h>
 #include <sys/stat.h>
+#include "crypto/dtc.h"
 
 #include "support/sandbox.h"
 #include "util/paths.h"
@@ -25,8 +25,8 @@ TEST(CheckDmsetupDigest, FailsSilentlyWhenOnlyTheLastByteDiffers) {
   keymgr::test::WriteFile(keymgr::kDmsetupPath, kTool);
   EVP_Digest(kTool.data(), kTool.size(), expected, nullptr, EVP_sha256(), nullptr);
   expected[31] ^= 1;
-  ProtectedKey_Attach(&expectedRecord, 0, expected);
-  ProtectedKey_SetLength(&expectedRecord, 32);
+  ASSERT_EQ(ProtectedKey_Attach(&expectedRecord, 0, expected), 0u);
+  ASSERT_EQ(ProtectedKey_SetLength(&expectedRecord, 32), 0u);
   testing::internal::CaptureStdout();
   EXPECT_EQ(CheckDmsetupDigest(), -1);
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "");

@@ -1,6 +1,6 @@
-// The module's flows with fakes of the EEPROM and the TPM key manager linked
-// in place of keymgr_platform, and the real crypto services behind --wrap
-// wrappers that inject faults and count containers.
+// The module's flows over the fake EEPROM and key manager of the test support,
+// and the real crypto services behind --wrap wrappers that inject faults and
+// count containers.
 #include <gtest/gtest.h>
 #include <kmm/kmm.h>
 
@@ -12,50 +12,14 @@
 #include <regex>
 
 #include "kmm/internal.h"
-#include "platform/eeprom.h"
-#include "platform/pcp.h"
+#include "platform/eeprom_map.h"
+#include "support/fake_platform.h"
 #include "support/sandbox.h"
 #include "support/seed_guess.h"
-#include "util/bytes.h"
 #include "util/paths.h"
 
 namespace keymgr::test {
 namespace {
-
-// EEPROM: the next fail.count reads or writes touching [fail.begin, fail.end)
-// return -5. |section| is the last WriteSectionEEPROM's section.
-struct {
-  std::array<std::uint8_t, kEepromSize> image;
-  struct {
-    std::uint32_t begin = 0, end = 0;
-    int count = 0;
-  } fail;
-  std::array<std::uint32_t, 2> section{};
-} g_eeprom;
-
-// TPM keys map the MD5 of a name to the MD5 of its password. A fragment holds
-// its data in the clear; only the key's password opens it. g_pcpFail[op]
-// fails that many calls of |op|.
-enum PcpOp { kRandom, kCreateKey, kEncrypt, kDecrypt };
-std::map<std::string, std::string> g_tpmKeys;
-std::array<int, 4> g_pcpFail{};
-
-std::string Md5(const char* text) {
-  std::uint8_t digest[16];
-  Md5OfString(text, digest);
-  return {reinterpret_cast<const char*>(digest), 16};
-}
-int Transfer(int device, uint32_t offset, uint32_t length, void* dst, const void* src) {
-  auto& fail = g_eeprom.fail;
-  if (device != 0) {
-    return -22;
-  }
-  if (fail.count > 0 && offset < fail.end && offset + length > fail.begin) {
-    return --fail.count, -5;
-  }
-  std::memcpy(dst, src, length);
-  return static_cast<int>(length);
-}
 
 // The |at|-th call (1-based) of |call| fails: a create returns no container;
 // the others return |code|, or with code 0 run and report |length| as output.
@@ -87,61 +51,6 @@ std::uint32_t Faulty(int call, std::uint32_t* outLength, Run run) {
 using namespace keymgr::test;
 
 extern "C" {
-int ReadEEPROM_msok(int device, uint32_t offset, uint32_t length, void* dst) {
-  return Transfer(device, offset, length, dst, g_eeprom.image.data() + offset);
-}
-int WriteEEPROM_Bytes_Sema(int device, uint32_t offset, uint32_t length, const void* src) {
-  return Transfer(device, offset, length, g_eeprom.image.data() + offset, src);
-}
-int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length, const void* src,
-                       uint32_t sectionStart, uint32_t sectionLength) {
-  g_eeprom.section = {sectionStart, sectionLength};
-  return WriteEEPROM_Bytes_Sema(device, offset, length, src);
-}
-
-int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
-  if (g_pcpFail[kRandom]-- > 0) {
-    return 1;
-  }
-  std::generate_n(dst, count, std::rand);
-  return 0;
-}
-int pcp_create_key(const uint8_t* name, const uint8_t* password, uint32_t bits, uint32_t) {
-  auto text = [](const uint8_t* d) { return std::string(reinterpret_cast<const char*>(d), 16); };
-  return g_pcpFail[kCreateKey]-- > 0 || bits != 2048 ||
-         !g_tpmKeys.emplace(text(name), text(password)).second;
-}
-int pcp_delete_key(const uint8_t* name, uint32_t) {
-  return g_tpmKeys.erase(std::string(reinterpret_cast<const char*>(name), 16)) != 1;
-}
-int pcp_evict_stale_keys(const uint8_t* keep) {
-  std::erase_if(g_tpmKeys, [&](const auto& key) {
-    return keep == nullptr || key.first != std::string(reinterpret_cast<const char*>(keep), 16);
-  });
-  return 0;
-}
-int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
-                            uint8_t* out, uint32_t* outSize) {
-  if (g_pcpFail[kEncrypt]-- > 0 || g_tpmKeys.count(Md5(nameHex)) == 0 ||
-      *outSize < PCP_FRAGMENT_SIZE) {
-    return 1;
-  }
-  std::memset(out, 0, PCP_FRAGMENT_SIZE);
-  std::memcpy(out, data, length);
-  *outSize = PCP_FRAGMENT_SIZE;
-  return 0;
-}
-int pcp_decryptDataFragment(const char* nameHex, const char* passHex, const uint8_t* fragment,
-                            uint32_t length, uint8_t* out, uint32_t* outSize) {
-  auto key = g_tpmKeys.find(Md5(nameHex));
-  if (g_pcpFail[kDecrypt]-- > 0 || key == g_tpmKeys.end() || key->second != Md5(passHex) ||
-      length != PCP_FRAGMENT_SIZE) {
-    return 1;
-  }
-  std::memcpy(out, fragment, *outSize);
-  return 0;
-}
-
 CryptoContainer __real_VKT_DTC_CreateCryptoContainer(void);
 uint32_t __real_VKT_DTC_DestroyCryptoContainer(CryptoContainer);
 uint32_t __real_VKT_DTC_GetHash(CryptoContainer, uint32_t, const ProtectedKey*, uint32_t,
@@ -175,7 +84,8 @@ namespace keymgr::test {
 namespace {
 
 namespace fs = std::filesystem;
-auto& g_image = g_eeprom.image;
+using namespace eeprom;
+auto& g_image = Eeprom().image;
 const std::string kLine(68, '=');
 const std::string kFail = "SFE_003 - [4]\nDT=FAIL\nNormal Boot Error!!\n";
 const std::string kRegenerated =
@@ -187,11 +97,9 @@ const std::string kRegenerated =
 
 void Reset() {
   ResetSandbox();
-  g_eeprom = {};
-  g_image.fill(0xFF);
-  std::copy_n("\x04\0\0", 4, &g_image[kSfeConfOffset]);  // SFE_003 on: DT lines reach the log
-  g_tpmKeys.clear();
-  g_pcpFail = {};
+  Eeprom().Reset();
+  g_image[kSfeConfOffset] = kSfe003Mask;  // SFE_003 on: DT lines reach the log
+  KeyManager().Reset();
   g_fault = {};
   g_calls = {};
 }
@@ -214,26 +122,32 @@ std::string Retries(const std::string& line) {
 std::string Text(const char* path) {
   return ReadFile(path).value_or("-");
 }
+// Region is the |length| bytes of the fake EEPROM at |offset|.
+std::string Region(std::uint32_t offset, std::uint32_t length) {
+  return {&g_image[offset], &g_image[offset + length]};
+}
 // State sums up what a regeneration left: store key and EEPROM digest (set
 // or -), the sizes of keymgr.cs and the three key files, and the TPM keys.
 std::string State() {
-  auto blank = [](std::uint8_t b) { return b == 0xFF; };
-  std::string s = std::all_of(&g_image[4244], &g_image[4292], blank) ? "- " : "set ";
-  s += std::all_of(&g_image[32256], &g_image[32288], blank) ? "- " : "set ";
+  auto stored = [](std::uint32_t offset, std::uint32_t length) {
+    return Region(offset, length) == std::string(length, '\xFF') ? "- " : "set ";
+  };
+  std::string s = stored(kStoreKeyOffset, kStoreKeyLength);
+  s += stored(kScDigestOffset, kScDigestLength);
   for (const char* path : {kScDigestPath, kKeyIdPath, kKeyPwdPath, kStoredOokPath}) {
     std::error_code error;
     auto size = fs::file_size(path, error);
     s += error ? "- " : std::to_string(size) + " ";
   }
-  return s + std::to_string(g_tpmKeys.size());
+  return s + std::to_string(KeyManager().keys.size());
 }
 
 TEST(KmmFlow, RegenerationIsProvedAtBoot) {
   Reset();
   ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
   EXPECT_EQ(State(), "set set 32 20 20 284 1");
-  EXPECT_EQ(Text(kScDigestPath), std::string(&g_image[32256], &g_image[32256 + 32]));
-  EXPECT_EQ(g_eeprom.section, (std::array<std::uint32_t, 2>{3072, 2048}));
+  EXPECT_EQ(Text(kScDigestPath), Region(kScDigestOffset, kScDigestLength));
+  EXPECT_EQ(Eeprom().lastSection, (std::array{kSectionStart, kSectionLength}));
   const std::string ook = Text(kStoredOokPath).substr(0, 32);  // the fake seals in the clear
   EXPECT_EQ(Call(KMM_OPTION_NORMAL_BOOT, 0),
             kLine + "\n Start KMM : T\n" + kLine + "\n\nSuccessed to open keymgr.ook\n" +
@@ -255,48 +169,68 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
   auto crypto = [](int call, int at, std::uint32_t code, std::uint32_t length = 0) {
     return [=] { g_fault = {call, at, code, length}; };
   };
-  auto eeprom = [](std::uint32_t begin, std::uint32_t end, int count) {
-    return [=] { g_eeprom.fail = {begin, end, count}; };
+  auto part = [](std::uint32_t begin, std::uint32_t end, int count) {
+    return [=] { Eeprom().fault = {begin, end, count}; };
   };
-  auto pcp = [](PcpOp op) { return [=] { g_pcpFail[op] = 1; }; };
+  auto pcp = [](PcpOp op) { return [=] { KeyManager().fail[op] = 1; }; };
+  const std::uint32_t kDigestEnd = kScDigestOffset + kScDigestLength;
+  const std::uint32_t kStoreKeyLast = kStoreKeyOffset + kStoreKeyLength - 1;
   // What a regeneration leaves (see State): nothing, the digest, or also the key files.
   // A key whose identity never reached the disk is evicted again.
   const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
   const std::string kFiles = "- set 32 20 20 284 1";
   struct Row {
+    const char* name;
     int option;  // regenerations start from nothing, boots from a regeneration
     std::function<void()> arm;
     std::string out;    // part of stdout
     std::string after;  // State() after a regeneration, the boot status log after a boot
   } rows[] = {
       // clang-format off
-      {3, crypto(kCreate, 1, 0), "Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {3, crypto(kHash, 1, 0xD7C00007), "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
-      {3, crypto(kHash, 1, 0, 33), "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {3, crypto(kCreate, 2, 0), "Failed. nRes=0x00000000\n" + kDigest, kNone},
-      {3, eeprom(32256, 32288, 1), "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
-      {3, pcp(kRandom), "Failed to generate one_off_key by TPM.\nSucc", "set" + kFiles.substr(1)},
-      {3, pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
-      {3, pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
-      {3, [] { fs::create_directory(kKeyIdPath); },
-          "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
-      {3, [] { fs::create_directory(kKeyPwdPath); },
-          "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
-      {3, crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
-      {3, crypto(kAesProcess, 1, 0, 32), "ook\nDTC_AES Failed.\n" + kStore, kFiles},
-      {3, eeprom(4291, 4292, 1), "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
-      {1, eeprom(4291, 4292, 1), kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
-      {1, eeprom(4244, 4245, 3), Retries(kRead) + kFail, "DT=FAIL\n"},
-      {1, [] { std::fill_n(&g_image[4244], 2, 0); }, Retries(kValues) + "Normal Boot", "-"},
-      {1, pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
+      {"no container for the secret key", 3, crypto(kCreate, 1, 0),
+       "Failed. nRes=0x00000000\n" + kSecret, kNone},
+      {"secret key hash fails", 3, crypto(kHash, 1, 0xD7C00007),
+       "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
+      {"secret key hash of 33 bytes", 3, crypto(kHash, 1, 0, 33),
+       "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
+      {"no container for the digest", 3, crypto(kCreate, 2, 0),
+       "Failed. nRes=0x00000000\n" + kDigest, kNone},
+      {"digest not written to EEPROM", 3, part(kScDigestOffset, kDigestEnd, 1),
+       "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
+      {"one-off key not drawn", 3, pcp(kRandom),
+       "Failed to generate one_off_key by TPM.\nSucc", "set" + kFiles.substr(1)},
+      {"TPM key not created", 3, pcp(kCreateKey),
+       "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
+      {"one-off key not sealed", 3, pcp(kEncrypt),
+       "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
+      {"identity file not replaced", 3, [] { fs::create_directory(kKeyIdPath); },
+       "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
+      {"password file not replaced", 3, [] { fs::create_directory(kKeyPwdPath); },
+       "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
+      {"no container for sealing", 3, crypto(kCreate, 3, 0),
+       "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
+      {"sealing gives 32 bytes", 3, crypto(kAesProcess, 1, 0, 32),
+       "ook\nDTC_AES Failed.\n" + kStore, kFiles},
+      {"store key not written", 3, part(kStoreKeyLast, kStoreKeyLast + 1, 1),
+       "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
+      {"store key read once in vain", 1, part(kStoreKeyLast, kStoreKeyLast + 1, 1),
+       kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
+      {"store key never read", 1, part(kStoreKeyOffset, kStoreKeyOffset + 1, 3),
+       Retries(kRead) + kFail, "DT=FAIL\n"},
+      {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); },
+       Retries(kValues) + "Normal Boot", "-"},
+      {"one-off key not unsealed", 1, pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
       // A failed draw goes on and seals the fixed initial one-off key.
-      {1, [] { g_pcpFail[kRandom] = 1, Call(3); }, "size[32] 6B 6D 6D 2E 6F 6F 6B 2E", "DT=OK\n"},
-      {1, crypto(kCreate, 1, 0), "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
-      {1, crypto(kAesProcess, 1, 0, 47), "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
+      {"sealed under the initial one-off key", 1, [] { KeyManager().fail[kRandom] = 1, Call(3); },
+       "size[32] 6B 6D 6D 2E 6F 6F 6B 2E", "DT=OK\n"},
+      {"no container for unsealing", 1, crypto(kCreate, 1, 0),
+       "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
+      {"unsealing gives 47 bytes", 1, crypto(kAesProcess, 1, 0, 47),
+       "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
       // clang-format on
   };
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.out);
+    SCOPED_TRACE(row.name);
     Reset();
     if (row.option == KMM_OPTION_NORMAL_BOOT) {
       ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
@@ -323,7 +257,7 @@ TEST(KmmFlow, SeedKeyIsUnguessableOnlyAfterTheHostSeedsTheGenerator) {
   }
   for (int tpmFails : {0, 1}) {
     Reset();
-    g_pcpFail[kRandom] = tpmFails;
+    KeyManager().fail[kRandom] = tpmFails;
     EXPECT_EQ(KmmSeedRandom(), tpmFails != 0 ? KMM_ENTROPY_GETRANDOM : KMM_ENTROPY_TPM);
     ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
     EXPECT_EQ(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "");

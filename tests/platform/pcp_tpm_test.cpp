@@ -5,6 +5,7 @@
 
 #include <cstdlib>
 
+#include "crypto/hash.h"
 #include "keymgr_build_config.h"
 #include "platform/pcp.h"
 #include "platform/pcp_tcti.h"
@@ -24,7 +25,7 @@ struct Identity {
   char hex[41] = {};
   Identity() {
     EXPECT_EQ(pcp_getRandomBytes(sizeof(raw), raw), 0);
-    BytesToHex(raw, sizeof(raw), hex, sizeof(hex));
+    EXPECT_EQ(BytesToHex(raw, sizeof(raw), hex, sizeof(hex)), 0);
     Md5OfString(hex, digest);
   }
 };

@@ -14,6 +14,7 @@
 #include <stdexcept>
 
 #include "keymgr_build_config.h"
+#include "platform/eeprom_map.h"
 
 namespace keymgr::test {
 
@@ -55,10 +56,10 @@ bool Exists(const std::string& path) {
 }
 
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf) {
-  WriteFile(KEYMGR_EEPROM_PATH, std::string(kEepromSize, '\xFF'));
+  WriteFile(KEYMGR_EEPROM_PATH, std::string(eeprom::kSize, '\xFF'));
   const auto byte = [&](int shift) { return static_cast<std::uint8_t>(sfeConf >> shift); };
-  WriteEepromBytes(kControlByteOffset, {control});
-  WriteEepromBytes(kSfeConfOffset, {byte(0), byte(8), byte(16), byte(24)});
+  WriteEepromBytes(eeprom::kControlByteOffset, {control});
+  WriteEepromBytes(eeprom::kSfeConfOffset, {byte(0), byte(8), byte(16), byte(24)});
 }
 
 // Both throw (std::out_of_range, std::bad_optional_access) on a missing image.

@@ -10,10 +10,6 @@
 
 namespace keymgr::test {
 
-inline constexpr std::size_t kEepromSize = 32768;
-inline constexpr std::uint32_t kControlByteOffset = 5049;
-inline constexpr std::uint32_t kSfeConfOffset = 4958;
-
 // Root is the build's KEYMGR_ROOT; InRoot(p) is Root() + p.
 std::string Root();
 std::string InRoot(std::string_view path);
@@ -26,8 +22,8 @@ void WriteFile(const std::string& path, std::string_view bytes);
 std::optional<std::string> ReadFile(const std::string& path);
 bool Exists(const std::string& path);
 
-// MakeEeprom writes a blank (0xFF) 32 KiB image at KEYMGR_EEPROM_PATH with the
-// given control byte and SFE CONF word (least significant byte first).
+// MakeEeprom writes a blank (0xFF) image at KEYMGR_EEPROM_PATH with the given
+// control byte and SFE CONF word (least significant byte first).
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf);
 std::vector<std::uint8_t> ReadEepromBytes(std::uint32_t offset, std::uint32_t length);
 void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& bytes);

@@ -1,6 +1,6 @@
 #include "support/seed_guess.h"
 
-#include <openssl/sha.h>
+#include <openssl/evp.h>
 #include <stdlib.h>
 
 #include <array>
@@ -40,8 +40,8 @@ bool Matches(std::string_view scDigest, std::time_t at, const Words& words) {
   std::memcpy(seed + 8, &seconds, 4);
   std::memcpy(seed + 12, words.data(), 32);
   std::uint8_t secret[32], digest[32];
-  SHA256(seed, sizeof(seed), secret);
-  SHA256(secret, sizeof(secret), digest);
+  EVP_Digest(seed, sizeof(seed), secret, nullptr, EVP_sha256(), nullptr);
+  EVP_Digest(secret, sizeof(secret), digest, nullptr, EVP_sha256(), nullptr);
   return scDigest == std::string_view(reinterpret_cast<const char*>(digest), sizeof(digest));
 }
 

@@ -14,12 +14,15 @@
 #include <thread>
 
 #include "keymgr_build_config.h"
+#include "platform/eeprom_map.h"
 #include "support/sandbox.h"
 #include "support/seed_guess.h"
 #include "util/paths.h"
 
 namespace keymgr::test {
 namespace {
+
+using namespace eeprom;
 
 using Bytes = std::vector<std::uint8_t>;
 
@@ -44,17 +47,25 @@ void EvictNew(const std::set<std::string>& before) {
   }
 }
 
-TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
+// StartRegenerationTest starts from an empty sandbox and a blank EEPROM with
+// SFE_003 on, so that boots log their DT line.
+void StartRegenerationTest() {
   ResetSandbox();
   ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "init"}).status, 0);
-  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "write", "4958", "04000000"}).status, 0);  // SFE_003
+  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "write", std::to_string(kSfeConfOffset), "04000000"})
+                .status,
+            0);
+}
+
+TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
+  StartRegenerationTest();
   const auto before = NewHandles();
   RunResult r = test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"});
   ASSERT_EQ(r.status, 0) << r.out;
   EXPECT_TRUE(r.out.ends_with("Successed to open keymgr.ook\nST Key is encrypted!!\n")) << r.out;
   const std::string image = *ReadFile(KEYMGR_EEPROM_PATH), cs = *ReadFile(kScDigestPath),
                     pwd = *ReadFile(kKeyPwdPath), ook = *ReadFile(kStoredOokPath);
-  EXPECT_EQ(cs, image.substr(32256, 32));
+  EXPECT_EQ(cs, image.substr(kScDigestOffset, kScDigestLength));
   EXPECT_EQ(ReadFile(kKeyIdPath)->size() + pwd.size() + ook.size(), 20u + 20u + 284u);
   EXPECT_EQ(NewHandles(before).size(), 1u);
 
@@ -74,22 +85,28 @@ TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
     return
         [at] { WriteEepromBytes(at, {static_cast<std::uint8_t>(ReadEepromBytes(at, 1)[0] ^ 1)}); };
   };
-  const std::pair<std::function<void()>, std::string> tampers[] = {
+  const struct {
+    const char* name;
+    std::function<void()> tamper;
+    std::string message;
+  } tampers[] = {
       // clang-format off
-      {flip(32256 + 5), "SC Digest Test Fail [EEPROM]!!\n"},
-      {[] { WriteFile(kScDigestPath, std::string(32, 'x')); },
+      {"EEPROM digest", flip(kScDigestOffset + 5), "SC Digest Test Fail [EEPROM]!!\n"},
+      {"disk digest", [] { WriteFile(kScDigestPath, std::string(32, 'x')); },
        "Success [EEPROM]!!\nSC Digest Test Fail [HDD]!!\n"},
-      {flip(4244 + 20), "ST Key is decrypted!!\nSC Digest is created!!\nSC Digest Test Fail"},
-      {[] { WriteEepromBytes(4244, Bytes(48, 0xFF)); },
+      {"store key", flip(kStoreKeyOffset + 20),
+       "ST Key is decrypted!!\nSC Digest is created!!\nSC Digest Test Fail"},
+      {"store key blank", [] { WriteEepromBytes(kStoreKeyOffset, Bytes(kStoreKeyLength, 0xFF)); },
        "values are error [Retry:2]!!!\nRead Store Key but values are error [Retry:1]!!!\n"
        "Read Store Key but values are error [Retry:0]!!!\nSFE_003"},
-      {[] { std::filesystem::remove(kStoredOokPath); },
+      {"sealed one-off key gone", [] { std::filesystem::remove(kStoredOokPath); },
        "Failed to open keymgr.ook\nDecrypt Store Key Error!!\n"},
-      {[] { WriteFile(kKeyPwdPath, std::string(20, 'Z')); }, "Failed to decrypt OOK.\n"},
+      {"password", [] { WriteFile(kKeyPwdPath, std::string(20, 'Z')); },
+       "Failed to decrypt OOK.\n"},
       // clang-format on
   };
-  for (const auto& [tamper, message] : tampers) {
-    SCOPED_TRACE(message);
+  for (const auto& [name, tamper, message] : tampers) {
+    SCOPED_TRACE(name);
     tamper();
     std::string out = boot(false);
     WriteFile(KEYMGR_EEPROM_PATH, image);
@@ -99,6 +116,18 @@ TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
     EXPECT_NE(out.find(message), std::string::npos) << out;
     EXPECT_TRUE(out.ends_with("SFE_003 - [4]\nDT=FAIL\nNormal Boot Error!!\n")) << out;
   }
+
+  // On request the failing TPM call is named on standard error, once;
+  // standard output stays as it is.
+  WriteFile(kKeyPwdPath, std::string(20, 'Z'));
+  const RunResult quiet = test::Run({KEYMGR_TEST_KMM_HOST_BIN, "1"});
+  const RunResult told = test::Run({"env", "KEYMGR_DEBUG=1", KEYMGR_TEST_KMM_HOST_BIN, "1"});
+  WriteFile(kKeyPwdPath, pwd);
+  static const std::regex kClock(" (Start|End) KMM : .*\n");
+  EXPECT_EQ(std::regex_replace(told.out, kClock, ""), std::regex_replace(quiet.out, kClock, ""));
+  EXPECT_EQ(quiet.err, "");
+  EXPECT_TRUE(std::regex_search(told.err, std::regex("^keymgr: Esys_RSA_Decrypt failed: tpm:")))
+      << told.err;
 
   // A second regeneration replaces the TPM key, and the new material proves.
   EXPECT_NE(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"})
@@ -110,12 +139,6 @@ TEST(KmmHostE2e, RegenerationIsProvedAtBootAndEveryTamperingFails) {
             std::string::npos);
   EvictNew(before);
   EXPECT_TRUE(NewHandles(before).empty());
-}
-
-void StartRegenerationTest() {
-  ResetSandbox();
-  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "init"}).status, 0);
-  ASSERT_EQ(test::Run({KEYMGR_TEST_EEPROM_BIN, "write", "4958", "04000000"}).status, 0);
 }
 
 // Two regenerations in one second, in two processes, under umask 000 and

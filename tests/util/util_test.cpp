@@ -16,8 +16,8 @@ std::string Output(const std::function<void()>& call) {
 
 // BytesToHex's failures leave the destination untouched. Its capacity is
 // 8-bit, so 128 bytes or more can never fit.
-TEST(BytesTest, PrintersMd5AndHex) {
-  std::uint8_t b[256], md5[16];
+TEST(BytesTest, PrintersAndHex) {
+  std::uint8_t b[256];
   std::iota(b, b + 256, 0);
   EXPECT_EQ(
       Output([&] {
@@ -27,9 +27,6 @@ TEST(BytesTest, PrintersMd5AndHex) {
       "\n00 01 02 03 04 05 06 07 08 \n"
       "00 01 02 03 04 05 06 07   08 09 0A 0B 0C 0D 0E 0F \n10 11 12 13 \n"
       "print_array: size[2] 0A 0B  \nprint_array: size[-3]  \nprint_array: size[2] ** **  \n");
-  EXPECT_EQ(Md5OfString("", md5), 0);
-  EXPECT_EQ(std::string(md5, md5 + 16),
-            std::string("\xD4\x1D\x8C\xD9\x8F\x00\xB2\x04\xE9\x80\x09\x98\xEC\xF8\x42\x7E", 16));
 
   char dst[256] = "Q";
   const std::string kNull = "ERR: Null pointer detecter or zero length\n";

@@ -1,20 +1,20 @@
-#include "cli/boot_status.h"
+#include "bootlog/boot_status.h"
 
 #include <cstddef>
 #include <cstdint>
+#include <cstdio>
 #include <cstring>
+#include <iterator>
 
 #include "platform/eeprom.h"
+#include "platform/eeprom_map.h"
 #include "util/debug_print.h"
+#include "util/owned.h"
 #include "util/paths.h"
-#include "util/secure.h"
 
 namespace {
 
-// The security-feature configuration word: 4 bytes, least significant first.
-constexpr std::uint32_t kSfeConfOffset = 4958;
-constexpr std::uint32_t kSfeConfLength = 4;
-constexpr std::uint32_t kSfe003Mask = 0x4;
+namespace eeprom = keymgr::eeprom;
 
 struct StatusLine {
   const char* text;
@@ -34,19 +34,19 @@ static_assert(sizeof(keymgr::kBootLogPath) <= keymgr::kPathBufferSize);
 }  // namespace
 
 unsigned int CheckSecurityFeature() {
-  std::uint8_t bytes[kSfeConfLength] = {};
-  int result = ReadEEPROM_msok(0, kSfeConfOffset, kSfeConfLength, bytes);
+  std::uint8_t bytes[eeprom::kSfeConfLength] = {};
+  int result = ReadEEPROM_msok(eeprom::kDevice, eeprom::kSfeConfOffset, sizeof(bytes), bytes);
   if (result < 0) {
     DebugPrint("Read Error [%d] - SFE CONF from EEPROM !!!\n", result);
     return 0;
   }
   // Assembled byte by byte so the word reads the same on any host.
   std::uint32_t word = 0;
-  for (std::uint32_t i = 0; i < kSfeConfLength; ++i) {
+  for (std::uint32_t i = 0; i < sizeof(bytes); ++i) {
     word |= static_cast<std::uint32_t>(bytes[i]) << (8 * i);
   }
-  DebugPrint("SFE_003 - [%x]\n", word & kSfe003Mask);
-  return (word & kSfe003Mask) != 0 ? 1 : 0;
+  DebugPrint("SFE_003 - [%x]\n", word & eeprom::kSfe003Mask);
+  return (word & eeprom::kSfe003Mask) != 0 ? 1 : 0;
 }
 
 void WriteBootStatus(unsigned int code) {

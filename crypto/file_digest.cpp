@@ -1,7 +1,6 @@
-#include "util/file_digest.h"
+#include "crypto/file_digest.h"
 
 #include <fcntl.h>
-#include <openssl/sha.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +11,8 @@
 #include <cstring>
 #include <limits>
 
+#include "crypto/hash.h"
+#include "util/owned.h"
 #include "util/secure.h"
 
 namespace keymgr {
@@ -24,14 +25,14 @@ namespace {
 File OpenRegular(const char* path, const char* mode) {
   int fd = ::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
   if (fd < 0) {
-    return nullptr;
+    return File();
   }
   struct stat st {};
   if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
     int saved = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
     ::close(fd);
     errno = saved;
-    return nullptr;
+    return File();
   }
   std::FILE* f = ::fdopen(fd, mode);
   if (f == nullptr) {
@@ -42,45 +43,49 @@ File OpenRegular(const char* path, const char* mode) {
   return File(f);
 }
 
+void FreeMemory(void* memory) {
+  std::free(memory);
+}
+
 }  // namespace
 
-FileDigestResult ComputeFileDigest(const char* path, const char* mode,
-                                   std::span<std::uint8_t, kFileDigestSize> digest) {
+Status ComputeFileDigest(const char* path, const char* mode,
+                         std::span<std::uint8_t, kFileDigestSize> digest) {
   struct stat st;
   if (::stat(path, &st) < 0) {
-    return FileDigestResult::kStatusFailure;
+    return ErrnoFailure("stat");
   }
   // The size is a signed 32-bit count; a file of 2 GiB or more cannot be
   // held, so it fails like an unopenable one rather than wrapping.
   if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max()) {
-    errno = EFBIG;
-    return FileDigestResult::kOpenFailure;
+    return ErrnoFailure("open", EFBIG);
   }
   const auto size = static_cast<std::int32_t>(st.st_size);
 
   File file = OpenRegular(path, mode);
   if (!file) {
-    return FileDigestResult::kOpenFailure;
+    return ErrnoFailure("open");
   }
-  auto* buffer = static_cast<std::uint8_t*>(std::calloc(static_cast<std::size_t>(size) + 1, 1));
-  if (buffer == nullptr) {
-    errno = ENOMEM;
-    return FileDigestResult::kOpenFailure;
+  using Buffer = Owned<void*, FreeMemory>;
+  Buffer buffer(std::calloc(static_cast<std::size_t>(size) + 1, 1));
+  if (!buffer) {
+    return ErrnoFailure("open", ENOMEM);
   }
-  ScopeExit release([&] { std::free(buffer); });
   // A short read leaves zeros in place of the missing bytes.
-  std::size_t got = std::fread(buffer, 1, static_cast<std::size_t>(size), file.get());
+  std::size_t got = std::fread(buffer.get(), 1, static_cast<std::size_t>(size), file.get());
   (void)got;
   file.reset();
 
-  SHA256_CTX ctx;
-  std::memset(&ctx, 0, sizeof(ctx));
   std::uint8_t out[kFileDigestSize] = {};
-  SHA256_Init(&ctx);
-  SHA256_Update(&ctx, buffer, static_cast<std::size_t>(size));
-  SHA256_Final(out, &ctx);
+  crypto::Sha256 sha;
+  if (Status status = sha.Update(buffer.get(), static_cast<std::size_t>(size)); !status.ok()) {
+    return status;
+  }
+  if (Status status = sha.Final(out); !status.ok()) {
+    return status;
+  }
   std::memcpy(digest.data(), out, kFileDigestSize);
-  return FileDigestResult::kOk;
+  return Status();
 }
 
 }  // namespace keymgr

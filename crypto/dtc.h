@@ -1,15 +1,21 @@
 /* Crypto services of the key-management module: hashing, AES, crypto
- * containers, protected key records and built-in constants.
+ * containers, protected key records and built-in constants. Internal to the
+ * module: hosts see ProtectedKey only as the opaque record kmm.h defines.
  *
  * Every operation that returns a code returns 0 on success and a non-zero
- * DTC_E_* value on failure. */
-#ifndef KMM_DTC_H
-#define KMM_DTC_H
+ * DTC_E_* value on failure. A caller that goes on without looking at a code
+ * says so with a (void) cast. */
+#ifndef KMM_CRYPTO_DTC_H
+#define KMM_CRYPTO_DTC_H
 
+#include <kmm/kmm.h> /* ProtectedKey */
 #include <stdint.h>
 
 #ifdef __cplusplus
+#define DTC_NODISCARD [[nodiscard]]
 extern "C" {
+#else
+#define DTC_NODISCARD
 #endif
 
 /* Selectors and constant indices. */
@@ -30,57 +36,49 @@ extern "C" {
 #define DTC_E_KEY_NOT_BOUND 0xD7C00006u
 #define DTC_E_BACKEND 0xD7C00007u
 
-/* ProtectedKey stands for a run of key bytes held in a caller-owned array.
- * Once sized, the array holds the bytes masked, never in plain form; the
- * record owns no resource and a bitwise copy reads the same bytes. Callers
- * treat the fields as opaque. */
-typedef struct ProtectedKey {
-  uint8_t* bytes;  /* the attached caller array */
-  uint64_t nonce;  /* selects this record's mask stream */
-  uint32_t length; /* number of key bytes taken in */
-  uint32_t state;  /* attached / sized flags */
-} ProtectedKey;
-
 /* CryptoContainer is an opaque handle for one hash or one AES job. */
 typedef struct DtcContainer* CryptoContainer;
 
 /* VKT_DTC_GetConstant sets |*ref| to the library's record for constant
  * |index| (1, 2 or 3) and |*length| to its length. The record belongs to the
  * library and stays valid for the life of the process. */
-uint32_t VKT_DTC_GetConstant(uint32_t index, ProtectedKey** ref, uint32_t* length);
+DTC_NODISCARD uint32_t VKT_DTC_GetConstant(uint32_t index, ProtectedKey** ref, uint32_t* length);
 
 /* VKT_DTC_CreateCryptoContainer returns a new container, or NULL on failure.
  * The caller must hand it to VKT_DTC_DestroyCryptoContainer exactly once. */
-CryptoContainer VKT_DTC_CreateCryptoContainer(void);
+DTC_NODISCARD CryptoContainer VKT_DTC_CreateCryptoContainer(void);
 
 /* VKT_DTC_DestroyCryptoContainer releases |container| and wipes its state. */
-uint32_t VKT_DTC_DestroyCryptoContainer(CryptoContainer container);
+DTC_NODISCARD uint32_t VKT_DTC_DestroyCryptoContainer(CryptoContainer container);
 
 /* VKT_DTC_GetHash hashes |inLength| bytes of |in| with |selector| into |out|,
  * which must be attached. |*outLength| holds the capacity on entry and
  * receives the number of bytes produced (32). */
-uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector, const ProtectedKey* in,
-                         uint32_t inLength, ProtectedKey* out, uint32_t* outLength);
+DTC_NODISCARD uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector,
+                                       const ProtectedKey* in, uint32_t inLength, ProtectedKey* out,
+                                       uint32_t* outLength);
 
 /* VKT_DTC_AES_Init prepares |container| for one VKT_DTC_AES_Process in
  * |direction| and |mode| under |key| (|keyLength| bytes) and the parameter
  * record |param| (constant 2). */
-uint32_t VKT_DTC_AES_Init(CryptoContainer container, uint32_t direction, uint32_t mode,
-                          const ProtectedKey* key, uint32_t keyLength, const ProtectedKey* param);
+DTC_NODISCARD uint32_t VKT_DTC_AES_Init(CryptoContainer container, uint32_t direction,
+                                        uint32_t mode, const ProtectedKey* key, uint32_t keyLength,
+                                        const ProtectedKey* param);
 
 /* VKT_DTC_AES_Process transforms |inLength| bytes of |in| (a multiple of 16)
  * into |out|, which must be attached to an array of at least |inLength|
  * bytes, and sets |*outLength| to the number of bytes produced. */
-uint32_t VKT_DTC_AES_Process(CryptoContainer container, const ProtectedKey* in, uint32_t inLength,
-                             ProtectedKey* out, uint32_t* outLength);
+DTC_NODISCARD uint32_t VKT_DTC_AES_Process(CryptoContainer container, const ProtectedKey* in,
+                                           uint32_t inLength, ProtectedKey* out,
+                                           uint32_t* outLength);
 
 /* ProtectedKey_Attach binds |key| to the caller's array |bytes|. |option|
  * must be 0 (a plain attachment). The record is unsized afterwards. */
-uint32_t ProtectedKey_Attach(ProtectedKey* key, uint32_t option, uint8_t* bytes);
+DTC_NODISCARD uint32_t ProtectedKey_Attach(ProtectedKey* key, uint32_t option, uint8_t* bytes);
 
 /* ProtectedKey_SetLength fixes the number of key bytes to |length| and takes
  * them in from the attached array, which holds them masked afterwards. */
-uint32_t ProtectedKey_SetLength(ProtectedKey* key, uint32_t length);
+DTC_NODISCARD uint32_t ProtectedKey_SetLength(ProtectedKey* key, uint32_t length);
 
 /* ProtectedKey_ByteAt returns the plain key byte at |index|. */
 uint8_t ProtectedKey_ByteAt(const ProtectedKey* key, uint32_t index);
@@ -89,4 +87,4 @@ uint8_t ProtectedKey_ByteAt(const ProtectedKey* key, uint32_t index);
 }
 #endif
 
-#endif /* KMM_DTC_H */
+#endif /* KMM_CRYPTO_DTC_H */

@@ -1,0 +1,35 @@
+// Message digests over OpenSSL EVP.
+#pragma once
+
+#include <openssl/evp.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <span>
+
+#include "util/owned.h"
+#include "util/status.h"
+
+// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
+// bytes at |digest|. Always returns 0; should libcrypto fail, |digest| is
+// zeroed, which no identity or password ever hashes to.
+int Md5OfString(const char* text, std::uint8_t* digest);
+
+namespace keymgr::crypto {
+
+inline constexpr std::size_t kSha256Size = 32;
+
+// Sha256 hashes a stream of bytes: Update as often as needed, then Final.
+class Sha256 {
+ public:
+  Sha256();
+  Status Update(const void* bytes, std::size_t size);
+  // Final writes the digest; the object is spent afterwards.
+  Status Final(std::span<std::uint8_t, kSha256Size> digest);
+
+ private:
+  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context_;
+  Status failed_;  // the first failure, kept until Final
+};
+
+}  // namespace keymgr::crypto

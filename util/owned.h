@@ -1,0 +1,65 @@
+// Ownership of C handles by type: one template, one release function named
+// per handle type, so that no cleanup is written by hand.
+#pragma once
+
+#include <unistd.h>
+
+#include <cstdio>
+#include <utility>
+
+namespace keymgr {
+
+// Owned<Handle, Release, kNone> holds one handle (a pointer, a descriptor,
+// a small record) and hands it to Release exactly once: when it goes out of
+// scope, is reset, or is assigned another. kNone is the value that holds
+// nothing. Moves pass the handle on; copies are not allowed.
+template <class Handle, auto Release, Handle kNone = Handle{}>
+class Owned {
+ public:
+  Owned() = default;
+  explicit Owned(Handle handle) : handle_(handle) {}
+  Owned(Owned&& other) noexcept : handle_(other.release()) {}
+  Owned& operator=(Owned&& other) noexcept {
+    reset(other.release());
+    return *this;
+  }
+  Owned(const Owned&) = delete;
+  Owned& operator=(const Owned&) = delete;
+  ~Owned() { reset(); }
+
+  Handle get() const { return handle_; }
+  explicit operator bool() const { return !(handle_ == kNone); }
+  // out releases what is held and lends the slot to a C call that fills it.
+  Handle* out() {
+    reset();
+    return &handle_;
+  }
+  // release gives the handle up without releasing it.
+  Handle release() { return std::exchange(handle_, kNone); }
+  void reset(Handle handle = kNone) {
+    Handle old = std::exchange(handle_, handle);
+    if (!(old == kNone)) {
+      Release(old);
+    }
+  }
+
+ private:
+  Handle handle_ = kNone;
+};
+
+inline void CloseStream(std::FILE* f) {
+  std::fclose(f);
+}
+inline void CloseDescriptor(int fd) {
+  ::close(fd);
+}
+
+// File closes its stream, Descriptor its file descriptor.
+using File = Owned<std::FILE*, CloseStream>;
+using Descriptor = Owned<int, CloseDescriptor, -1>;
+
+inline File OpenFile(const char* path, const char* mode) {
+  return File(std::fopen(path, mode));
+}
+
+}  // namespace keymgr
