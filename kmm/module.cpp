@@ -3,7 +3,9 @@
 #include <cstring>
 
 #include "kmm/internal.h"
+#include "platform/pcp.h"
 #include "util/debug_print.h"
+#include "util/secure.h"
 
 using namespace keymgr::kmm;
 
@@ -39,6 +41,10 @@ KeyContext g_keyContext;
 extern "C" KeyContext* KeyManage(int32_t option, int logFlag) {
   // Every entry starts from nothing, even one that is then rejected.
   std::memset(&g_keyContext, 0, sizeof(g_keyContext));
+  // The flow's TPM calls share one connection, and nothing of the TPM stays
+  // held once the entry returns.
+  pcp_hold_connection();
+  keymgr::ScopeExit release([] { pcp_release_connection(); });
   if (option == KMM_OPTION_NORMAL_BOOT) {
     if (NormalBoot(&g_keyContext, logFlag) != 0) {
       DebugPrint("Normal Boot Error!!\n");

@@ -1,15 +1,15 @@
-// The host call that seeds the C library generator for the seed key.
+// The host calls around the TPM: seeding the C library generator for the
+// seed key, and persisting the storage root key.
 #include <kmm/kmm.h>
-#include <openssl/crypto.h>
 #include <stdlib.h>
 #include <sys/random.h>
 
 #include <array>
-#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
 
+#include "crypto/hash.h"
 #include "platform/pcp.h"
 #include "util/io.h"
 #include "util/secure.h"
@@ -22,27 +22,52 @@ namespace {
 constexpr std::size_t kStateWords = 64;
 std::array<std::uint32_t, kStateWords> g_state;
 constexpr std::size_t kDrawSize = (kStateWords - 1) * sizeof(std::uint32_t);
+constexpr std::uint32_t kTpmDraw = 64;
+
+// Expand mixes |count| TPM bytes into all of |state|: block i of it is
+// XORed with SHA-256(i, TPM bytes).
+bool Expand(const std::uint8_t* tpm, std::uint32_t count, keymgr::Secret<kDrawSize>& state) {
+  keymgr::Secret<keymgr::crypto::kSha256Size> block;
+  for (std::size_t at = 0; at < kDrawSize; at += block.size()) {
+    const auto index = static_cast<std::uint8_t>(at / block.size());
+    keymgr::crypto::Sha256 sha;
+    if (!sha.Update(&index, 1).ok() || !sha.Update(tpm, count).ok() ||
+        !sha.Final(block.bytes).ok()) {
+      return false;
+    }
+    for (std::size_t i = 0; i < block.size() && at + i < kDrawSize; ++i) {
+      state[at + i] ^= block[i];
+    }
+  }
+  return true;
+}
 
 }  // namespace
 
 extern "C" int KmmSeedRandom(void) {
-  keymgr::Secret<kDrawSize> tpm;
-  keymgr::Secret<kDrawSize> kernel;
-  const bool fromTpm = pcp_getRandomBytes(kDrawSize, tpm.data()) == 0;
-  const bool fromKernel =
-      keymgr::MoveAll([&](std::size_t done,
-                          std::size_t left) { return ::getrandom(kernel.data() + done, left, 0); },
-                      kernel.size());
+  keymgr::Secret<kDrawSize> state;
+  const bool fromKernel = keymgr::MoveAll(
+      [&](std::size_t done, std::size_t left) { return ::getrandom(state.data() + done, left, 0); },
+      state.size());
+  if (!fromKernel) {
+    state.bytes.fill(0);
+  }
+  // One draw from the TPM, in clear on the bus, is expanded over the whole
+  // state and mixed with the kernel's: either source alone keeps the state
+  // unpredictable, should the other be weak or watched on its bus.
+  keymgr::Secret<kTpmDraw> tpm;
+  std::uint32_t drawn = 0;
+  const bool fromTpm = pcp_getEntropyBytes(kTpmDraw, tpm.data(), &drawn) == 0 && drawn >= 16 &&
+                       Expand(tpm.data(), drawn, state);
   if (!fromTpm && !fromKernel) {
     return -1;
   }
-  // Both sources when both answer: either one alone keeps the state
-  // unpredictable, should the other be weak or watched on its bus.
-  for (std::size_t i = 0; i < kDrawSize; ++i) {
-    tpm[i] ^= kernel[i];
-  }
   ::initstate(1, reinterpret_cast<char*>(g_state.data()), sizeof(g_state));
-  std::memcpy(g_state.data() + 1, tpm.data(), kDrawSize);
+  std::memcpy(g_state.data() + 1, state.data(), kDrawSize);
   ::setstate(reinterpret_cast<char*>(g_state.data()));
   return fromTpm ? KMM_ENTROPY_TPM : KMM_ENTROPY_GETRANDOM;
+}
+
+extern "C" int KmmPersistSrk(void) {
+  return pcp_persist_srk() == 0 ? 0 : -1;
 }

@@ -1,8 +1,9 @@
-// Platform key manager over a TPM 2.0. Each call opens the TPM on the
-// KEYMGR_TCTI transport, does its work and closes it again. Without a
-// resource manager on that transport, each call first flushes what a dead
-// process left loaded. Every call
-// returns 0 on success and non-zero on failure; no TPM error ends the process.
+// Platform key manager over a TPM 2.0 on the KEYMGR_TCTI transport. A call
+// opens the TPM, does its work and closes it again, unless the calls are
+// held together (pcp_hold_connection). Every TPM command has a deadline
+// (KEYMGR_TPM_TIMEOUT_MS); a TPM that does not answer in time, or a
+// transport that hangs up, fails the call. Every call returns 0 on success
+// and non-zero on failure; no TPM error ends the process or raises a signal.
 #pragma once
 
 #include <stdint.h>
@@ -17,9 +18,21 @@ extern "C" {
 // Size of a sealed fragment: 12-byte header and 256-byte RSA-OAEP ciphertext.
 #define PCP_FRAGMENT_SIZE 268u
 
+// pcp_hold_connection makes the calls that follow share one connection, its
+// storage parent and its session, until pcp_release_connection, which
+// flushes and closes all of it: nothing of the TPM stays held afterwards.
+void pcp_hold_connection(void);
+void pcp_release_connection(void);
+
 // pcp_getRandomBytes fills |count| bytes of |dst| from the TPM's generator;
 // on failure |dst| is left as it was.
 PCP_NODISCARD int pcp_getRandomBytes(uint32_t count, uint8_t* dst);
+
+// pcp_getEntropyBytes draws up to |count| bytes (64 at most) from the TPM's
+// generator in one command with no session, and sets |*drawn| to how many
+// came. They cross the bus in clear: callers only mix them with other
+// randomness, never use them as a key.
+PCP_NODISCARD int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn);
 
 // pcp_create_key creates an RSA-|bits| decryption key authorised by the 16
 // bytes |passwordDigest| and makes it persistent at the handle derived from
@@ -40,18 +53,25 @@ PCP_NODISCARD int pcp_delete_key(const uint8_t* nameDigest, uint32_t flags);
 PCP_NODISCARD int pcp_evict_stale_keys(const uint8_t* keepNameDigest);
 
 // pcp_encryptDataFragment seals |length| bytes of |data| under the key whose
-// name digest is the MD5 of |nameHex|. |*outSize| is the capacity of |out|
-// on entry and PCP_FRAGMENT_SIZE on success.
+// name digest is the MD5 of |nameHex|: on the host, with the key's public
+// area as the TPM gives it. |*outSize| is the capacity of |out| on entry and
+// PCP_FRAGMENT_SIZE on success.
 PCP_NODISCARD int pcp_encryptDataFragment(const char* nameHex, const char* passHex,
                                           const uint8_t* data, uint32_t length, uint8_t* out,
                                           uint32_t* outSize);
 
 // pcp_decryptDataFragment opens a fragment sealed by pcp_encryptDataFragment,
-// authorising with the MD5 of |passHex|. |*outSize| is the capacity of |out|
-// on entry and the plaintext length on success.
+// authorising with the MD5 of |passHex|, in a session bound to the key that
+// returns the plaintext encrypted. |*outSize| is the capacity of |out| on
+// entry and the plaintext length on success.
 PCP_NODISCARD int pcp_decryptDataFragment(const char* nameHex, const char* passHex,
                                           const uint8_t* fragment, uint32_t length, uint8_t* out,
                                           uint32_t* outSize);
+
+// pcp_persist_srk makes the standard storage root key persistent at
+// 0x81000001, or finds it there; keys are then created under it without
+// creating a primary each time.
+PCP_NODISCARD int pcp_persist_srk(void);
 
 #ifdef __cplusplus
 }

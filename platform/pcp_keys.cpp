@@ -1,13 +1,18 @@
-// The platform key manager's operations over a TPM 2.0. Each call opens its
-// own connection (platform/tpm.h) and releases everything before it returns,
-// so a transport error spoils only the call where it happens. Inside, every
-// step returns a Status; the C entry points reduce it to 0 or 1.
+// The platform key manager's operations over a TPM 2.0 (platform/tpm.h holds
+// the connection). Inside, every step returns a Status; the C entry points
+// reduce it to 0 or 1. The commands each flow sends are few on purpose: a
+// discrete TPM takes tens to hundreds of milliseconds for an asymmetric
+// operation, so a boot sends one (the RSA decrypt) and a regeneration one
+// RSA key generation and at most one primary.
 #include <openssl/crypto.h>
+#include <tss2/tss2_mu.h>
 
 #include <algorithm>
 #include <cstring>
+#include <optional>
 
 #include "crypto/hash.h"
+#include "crypto/rsa.h"
 #include "platform/fragment.h"
 #include "platform/pcp.h"
 #include "platform/tpm.h"
@@ -22,10 +27,12 @@ using keymgr::Status;
 using namespace keymgr::tpm;
 
 constexpr uint32_t kDigestSize = 16;
-// Largest single draw; the callers ask for 20 to 252 bytes.
+// Largest single draw; the callers ask for 20 or 32 bytes.
 constexpr uint32_t kMaxRandom = 1024;
 // OAEP with SHA-256 spends two digests and two bytes of the modulus.
 constexpr uint32_t kOaepOverhead = 2 * 32 + 2;
+// TPM2_GetRandom gives at most the size of the TPM's largest digest.
+constexpr uint32_t kMaxEntropy = sizeof(TPMU_HA);
 
 // Keys this key manager creates carry this authPolicy, the SHA-256 of
 // "keymgr: sealing key of the one-off key". No policy session can reach it
@@ -38,17 +45,22 @@ constexpr uint8_t kKeyMarker[32] = {
 constexpr TPMA_OBJECT kKeyAttributes = TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
                                        TPMA_OBJECT_FIXEDPARENT | TPMA_OBJECT_SENSITIVEDATAORIGIN |
                                        TPMA_OBJECT_USERWITHAUTH | TPMA_OBJECT_NODA;
-constexpr uint32_t kOwnerPersistentFirst = 0x81000000u;
+
+// Keys are made persistent in the owner range, above the handles TCG's
+// registry keeps for storage root keys (0x81000000-0x8100FFFF) and
+// endorsement keys (0x81010000-0x8101FFFF), so that a device's SRK and EK are
+// never in the way and never read when stale keys are swept.
+constexpr uint32_t kOwnKeysFirst = 0x81020000u;
 constexpr uint32_t kOwnerPersistentLast = 0x817FFFFFu;
 
-// Keys are made persistent in the owner range 0x81000000-0x817FFFFF: the low
-// 23 bits of the handle are the first three bytes of the name digest read
-// big-endian, top bit dropped. MD5 spreads the names evenly, so two live keys
+// The handle of a key is derived from the first three bytes of its name
+// digest, read big-endian. MD5 spreads the names evenly, so two live keys
 // meet on one handle with odds of about 1 in 8 million; pcp_create_key then
 // refuses rather than overwrite the other key.
 uint32_t PersistentHandle(const uint8_t* nameDigest) {
-  uint32_t low = (uint32_t{nameDigest[0]} << 16) | (uint32_t{nameDigest[1]} << 8) | nameDigest[2];
-  return kOwnerPersistentFirst | (low & 0x007FFFFFu);
+  const uint32_t bits =
+      (uint32_t{nameDigest[0]} << 16) | (uint32_t{nameDigest[1]} << 8) | nameDigest[2];
+  return kOwnKeysFirst + bits % (kOwnerPersistentLast - kOwnKeysFirst + 1);
 }
 
 // HandleOfName is the persistent handle of the key named by |nameHex|.
@@ -73,62 +85,16 @@ bool IsOwnKey(const TPMT_PUBLIC& area) {
 // room for OAEP and fit the fragment; 0 for any other key.
 uint32_t ModulusSize(const TPMT_PUBLIC& area) {
   const uint32_t size = IsOwnKey(area) ? area.parameters.rsaDetail.keyBits / 8u : 0;
-  return size > kOaepOverhead && size <= kMaxCipherSize ? size : 0;
+  return size > kOaepOverhead && size <= kMaxCipherSize && area.unique.rsa.size == size ? size : 0;
 }
 
-// OpenOwnKey opens the persistent object at |handle| into |key| when it is a
-// key of this key manager, and gives its modulus size.
-Status OpenOwnKey(Connection& tpm, uint32_t handle, PersistentObject& key,
-                  uint32_t* modulusSize = nullptr) {
-  ESYS_TR tr = ESYS_TR_NONE;
-  if (Status status = Check(
-          "Esys_TR_FromTPMPublic",
-          Esys_TR_FromTPMPublic(tpm.ctx(), handle, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, &tr));
-      !status.ok()) {
+// ReadOwnKey reads the public area of the object at |handle| and fails,
+// as for a missing key, when it is not a key of this key manager.
+Status ReadOwnKey(Connection& tpm, uint32_t handle, TPM2B_PUBLIC* area) {
+  if (Status status = ReadPublic(tpm, handle, area); !status.ok()) {
     return status;
   }
-  key.reset(tpm.Object(tr));
-  Output<TPM2B_PUBLIC> keyPublic;
-  if (Status status = Check("Esys_ReadPublic",
-                            Esys_ReadPublic(tpm.ctx(), tr, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
-                                            keyPublic.out(), nullptr, nullptr));
-      !status.ok()) {
-    return status;
-  }
-  const uint32_t size = ModulusSize(keyPublic.get()->publicArea);
-  if (size == 0) {
-    key.reset();
-    return Refused("not a key of this system");
-  }
-  if (modulusSize != nullptr) {
-    *modulusSize = size;
-  }
-  return Status();
-}
-
-// EvictKey evicts |key| from the TPM. ESAPI may release the handle of an
-// evicted persistent object, so it is given up either way: whatever ESAPI
-// still holds goes with the connection.
-Status EvictKey(Connection& tpm, PersistentObject& key, uint32_t handle) {
-  ESYS_TR none = ESYS_TR_NONE;
-  return Check("Esys_EvictControl",
-               Esys_EvictControl(tpm.ctx(), ESYS_TR_RH_OWNER, key.release().tr, ESYS_TR_PASSWORD,
-                                 ESYS_TR_NONE, ESYS_TR_NONE, handle, &none));
-}
-
-// HandleFree tells whether nothing sits at persistent |handle|; an error
-// counts as taken.
-bool HandleFree(Connection& tpm, uint32_t handle) {
-  TPMI_YES_NO more = TPM2_NO;
-  Output<TPMS_CAPABILITY_DATA> data;
-  if (!Check("Esys_GetCapability",
-             Esys_GetCapability(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
-                                TPM2_CAP_HANDLES, handle, 1, &more, data.out()))
-           .ok()) {
-    return false;
-  }
-  const TPML_HANDLE& handles = data.get()->data.handles;
-  return handles.count == 0 || handles.handle[0] != handle;
+  return ModulusSize(area->publicArea) != 0 ? Status() : Refused("not a key of this system");
 }
 
 TPMT_RSA_DECRYPT OaepSha256() {
@@ -138,29 +104,32 @@ TPMT_RSA_DECRYPT OaepSha256() {
   return scheme;
 }
 
+// GetRandom draws up to |want| bytes in one command, in |session| (the
+// response encrypted) or with none.
+Status GetRandom(Connection& tpm, ESYS_TR session, uint16_t want,
+                 SecretOutput<TPM2B_DIGEST>& part) {
+  return Run(
+      tpm, "Esys_GetRandom",
+      [&] { return Esys_GetRandom_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE, want); },
+      [&] { return Esys_GetRandom_Finish(tpm.ctx(), part.out()); });
+}
+
 // Draws land in a wiped staging buffer and reach |dst| only when all |count|
 // bytes are in, so that a failed call leaves |dst| as it was.
-Status DrawRandom(uint32_t count, uint8_t* dst) {
+Status DrawRandom(Connection& tpm, uint32_t count, uint8_t* dst) {
   Secret<kMaxRandom> drawn;
   if (dst == nullptr || count > drawn.size()) {
     return Refused("pcp_getRandomBytes");
   }
   // The draws become keys and passwords: the response is encrypted.
-  Connection tpm;
-  if (Status status = Connect(tpm); !status.ok()) {
-    return status;
-  }
-  if (Status status = StartSaltedSession(tpm, TPMA_SESSION_ENCRYPT); !status.ok()) {
+  if (Status status = UseSaltedSession(tpm, TPMA_SESSION_ENCRYPT); !status.ok()) {
     return status;
   }
   uint32_t filled = 0;
   while (filled < count) {
-    const auto want = static_cast<uint16_t>(std::min<uint32_t>(count - filled, sizeof(TPMU_HA)));
+    const auto want = static_cast<uint16_t>(std::min(count - filled, kMaxEntropy));
     SecretOutput<TPM2B_DIGEST> part;
-    if (Status status =
-            Check("Esys_GetRandom", Esys_GetRandom(tpm.ctx(), tpm.session.get().tr, ESYS_TR_NONE,
-                                                   ESYS_TR_NONE, want, part.out()));
-        !status.ok()) {
+    if (Status status = GetRandom(tpm, tpm.session.get().tr, want, part); !status.ok()) {
       return status;
     }
     const uint32_t take = std::min<uint32_t>({part.get()->size, want, sizeof(part.get()->buffer)});
@@ -174,32 +143,23 @@ Status DrawRandom(uint32_t count, uint8_t* dst) {
   return Status();
 }
 
-Status CreateKey(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint32_t bits) {
-  // A larger modulus would not fit the fragment's 256 ciphertext bytes.
-  if (nameDigest == nullptr || passwordDigest == nullptr || (bits != 1024 && bits != 2048)) {
-    return Refused("pcp_create_key");
+Status DrawEntropy(Connection& tpm, uint32_t count, uint8_t* dst, uint32_t* drawn) {
+  if (dst == nullptr || drawn == nullptr) {
+    return Refused("pcp_getEntropyBytes");
   }
-  const uint32_t handle = PersistentHandle(nameDigest);
-  Connection tpm;
-  if (Status status = Connect(tpm); !status.ok()) {
+  SecretOutput<TPM2B_DIGEST> part;
+  const auto want = static_cast<uint16_t>(std::min(count, kMaxEntropy));
+  if (Status status = GetRandom(tpm, ESYS_TR_NONE, want, part); !status.ok()) {
     return status;
   }
-  if (!HandleFree(tpm, handle)) {
-    return Refused("handle taken");
-  }
-  // The auth value is the first command parameter of TPM2_Create: the salted
-  // session carries it encrypted.
-  if (Status status = StartSaltedSession(tpm, TPMA_SESSION_DECRYPT); !status.ok()) {
-    return status;
-  }
+  *drawn = std::min<uint32_t>({part.get()->size, want, sizeof(part.get()->buffer)});
+  std::memcpy(dst, part.get()->buffer, *drawn);
+  return Status();
+}
 
-  TPM2B_SENSITIVE_CREATE sensitive{};
-  ScopeExit wipeSensitive([&] { OPENSSL_cleanse(&sensitive, sizeof(sensitive)); });
-  sensitive.sensitive.userAuth.size = kDigestSize;
-  std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, kDigestSize);
-
-  TPM2B_PUBLIC templ{};
-  TPMT_PUBLIC& area = templ.publicArea;
+// KeyTemplate is the template of every key this key manager creates.
+TPM2B_TEMPLATE KeyTemplate(uint32_t bits) {
+  TPMT_PUBLIC area{};
   area.type = TPM2_ALG_RSA;
   area.nameAlg = TPM2_ALG_SHA256;
   area.objectAttributes = kKeyAttributes;
@@ -211,67 +171,90 @@ Status CreateKey(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint3
   rsa.scheme.details.oaep.hashAlg = TPM2_ALG_SHA256;
   rsa.keyBits = static_cast<TPMI_RSA_KEY_BITS>(bits);
   rsa.exponent = 0;
-  TPM2B_DATA outsideInfo{};
-  TPML_PCR_SELECTION pcrs{};
+  TPM2B_TEMPLATE templ{};
+  std::size_t size = 0;
+  // A TPMT_PUBLIC always fits the template buffer.
+  (void)Tss2_MU_TPMT_PUBLIC_Marshal(&area, templ.buffer, sizeof(templ.buffer), &size);
+  templ.size = static_cast<uint16_t>(size);
+  return templ;
+}
 
-  Output<TPM2B_PRIVATE> keyPrivate;
-  Output<TPM2B_PUBLIC> keyPublic;
-  if (Status status =
-          Check("Esys_Create",
-                Esys_Create(tpm.ctx(), tpm.primary.get().tr, tpm.session.get().tr, ESYS_TR_NONE,
-                            ESYS_TR_NONE, &sensitive, &templ, &outsideInfo, &pcrs, keyPrivate.out(),
-                            keyPublic.out(), nullptr, nullptr, nullptr));
-      !status.ok()) {
+Status CreateKey(Connection& tpm, const uint8_t* nameDigest, const uint8_t* passwordDigest,
+                 uint32_t bits) {
+  // A larger modulus would not fit the fragment's 256 ciphertext bytes.
+  if (nameDigest == nullptr || passwordDigest == nullptr || (bits != 1024 && bits != 2048)) {
+    return Refused("pcp_create_key");
+  }
+  const uint32_t handle = PersistentHandle(nameDigest);
+  // The auth value is the first command parameter of TPM2_CreateLoaded: the
+  // salted session carries it encrypted.
+  if (Status status = UseSaltedSession(tpm, TPMA_SESSION_DECRYPT); !status.ok()) {
     return status;
   }
+  TPM2B_SENSITIVE_CREATE sensitive{};
+  ScopeExit wipeSensitive([&] { OPENSSL_cleanse(&sensitive, sizeof(sensitive)); });
+  sensitive.sensitive.userAuth.size = kDigestSize;
+  std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, kDigestSize);
+  const TPM2B_TEMPLATE templ = KeyTemplate(bits);
+
   ESYS_TR loaded = ESYS_TR_NONE;
-  if (Status status = Check(
-          "Esys_Load", Esys_Load(tpm.ctx(), tpm.primary.get().tr, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                                 ESYS_TR_NONE, keyPrivate.get(), keyPublic.get(), &loaded));
+  Output<TPM2B_PUBLIC> keyPublic;
+  if (Status status = Run(
+          tpm, "Esys_CreateLoaded",
+          [&] {
+            return Esys_CreateLoaded_Async(tpm.ctx(), tpm.Parent(), tpm.session.get().tr,
+                                           ESYS_TR_NONE, ESYS_TR_NONE, &sensitive, &templ);
+          },
+          [&] { return Esys_CreateLoaded_Finish(tpm.ctx(), &loaded, nullptr, keyPublic.out()); });
       !status.ok()) {
     return status;
   }
   TransientObject loadedKey(tpm.Object(loaded));
+  // The handle is checked by the TPM itself: the eviction fails when it is
+  // taken.
   ESYS_TR persistent = ESYS_TR_NONE;
-  if (Status status = Check("Esys_EvictControl",
-                            Esys_EvictControl(tpm.ctx(), ESYS_TR_RH_OWNER, loaded, ESYS_TR_PASSWORD,
-                                              ESYS_TR_NONE, ESYS_TR_NONE, handle, &persistent));
+  if (Status status = Run(
+          tpm, "Esys_EvictControl",
+          [&] {
+            return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, loaded, ESYS_TR_PASSWORD,
+                                           ESYS_TR_NONE, ESYS_TR_NONE, handle);
+          },
+          [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
       !status.ok()) {
     return status;
   }
   PersistentObject key(tpm.Object(persistent));
+  // The public area came from the TPM with the key: sealing to it in the same
+  // connection needs no command.
+  tpm.createdHandle = handle;
+  tpm.createdPublic = *keyPublic.get();
   return Status();
 }
 
 // An object this key manager did not create is left alone, as if absent.
-Status DeleteKey(const uint8_t* nameDigest) {
+Status DeleteKey(Connection& tpm, const uint8_t* nameDigest) {
   if (nameDigest == nullptr) {
     return Refused("pcp_delete_key");
   }
   const uint32_t handle = PersistentHandle(nameDigest);
-  Connection tpm;
-  PersistentObject key;
-  if (Status status = Connect(tpm); !status.ok()) {
+  TPM2B_PUBLIC area{};
+  if (Status status = ReadOwnKey(tpm, handle, &area); !status.ok()) {
     return status;
   }
-  if (Status status = OpenOwnKey(tpm, handle, key); !status.ok()) {
-    return status;
-  }
-  return EvictKey(tpm, key, handle);
+  return EvictPersistent(tpm, handle);
 }
 
-Status EvictStaleKeys(const uint8_t* keepNameDigest) {
-  Connection tpm;
-  if (Status status = Connect(tpm); !status.ok()) {
-    return status;
-  }
+Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
   const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
   TPMI_YES_NO more = TPM2_NO;
   Output<TPMS_CAPABILITY_DATA> data;
-  if (Status status = Check(
-          "Esys_GetCapability",
-          Esys_GetCapability(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, TPM2_CAP_HANDLES,
-                             kOwnerPersistentFirst, TPM2_MAX_CAP_HANDLES, &more, data.out()));
+  if (Status status = Run(
+          tpm, "Esys_GetCapability",
+          [&] {
+            return Esys_GetCapability_Async(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
+                                            TPM2_CAP_HANDLES, kOwnKeysFirst, TPM2_MAX_CAP_HANDLES);
+          },
+          [&] { return Esys_GetCapability_Finish(tpm.ctx(), &more, data.out()); });
       !status.ok()) {
     return status;
   }
@@ -281,57 +264,48 @@ Status EvictStaleKeys(const uint8_t* keepNameDigest) {
   const TPML_HANDLE& handles = data.get()->data.handles;
   for (uint32_t i = 0; i < handles.count; ++i) {
     const uint32_t handle = handles.handle[i];
-    PersistentObject key;
-    if (handle > kOwnerPersistentLast || handle == keep || !OpenOwnKey(tpm, handle, key).ok()) {
+    TPM2B_PUBLIC area{};
+    if (handle > kOwnerPersistentLast || handle == keep || !ReadOwnKey(tpm, handle, &area).ok()) {
       continue;
     }
-    if (Status status = EvictKey(tpm, key, handle); !status.ok()) {
+    if (Status status = EvictPersistent(tpm, handle); !status.ok()) {
       result = status;
     }
   }
   return result;
 }
 
-// The password is not needed to seal: only the key's public part is used.
-Status Seal(const char* nameHex, const uint8_t* data, uint32_t length, uint8_t* out,
-            uint32_t* outSize) {
+// Sealing needs only the key's public part: it is done on the host, and the
+// password is not needed.
+Status Seal(Connection& tpm, const char* nameHex, const uint8_t* data, uint32_t length,
+            uint8_t* out, uint32_t* outSize) {
   if (nameHex == nullptr || data == nullptr || out == nullptr || outSize == nullptr ||
       *outSize < PCP_FRAGMENT_SIZE) {
     return Refused("pcp_encryptDataFragment");
   }
-  Connection tpm;
-  PersistentObject key;
-  uint32_t modulusSize = 0;
-  if (Status status = Connect(tpm); !status.ok()) {
+  const uint32_t handle = HandleOfName(nameHex);
+  TPM2B_PUBLIC area{};
+  if (tpm.createdHandle == handle) {
+    area = tpm.createdPublic;
+  } else if (Status status = ReadPublic(tpm, handle, &area); !status.ok()) {
     return status;
   }
-  if (Status status = OpenOwnKey(tpm, HandleOfName(nameHex), key, &modulusSize); !status.ok()) {
-    return status;
-  }
-  if (length > modulusSize - kOaepOverhead) {
+  const TPMT_PUBLIC& key = area.publicArea;
+  const uint32_t modulusSize = ModulusSize(key);
+  if (modulusSize == 0 || length > modulusSize - kOaepOverhead) {
     return Refused("pcp_encryptDataFragment");
   }
-  // The plaintext is the first command parameter: it crosses the bus
-  // encrypted under the salted session.
-  if (Status status = StartSaltedSession(tpm, TPMA_SESSION_DECRYPT); !status.ok()) {
-    return status;
-  }
-  TPM2B_PUBLIC_KEY_RSA message{};
-  ScopeExit wipeMessage([&] { OPENSSL_cleanse(&message, sizeof(message)); });
-  message.size = static_cast<uint16_t>(length);
-  std::memcpy(message.buffer, data, length);
-  TPMT_RSA_DECRYPT scheme = OaepSha256();
-  TPM2B_DATA label{};
-  Output<TPM2B_PUBLIC_KEY_RSA> cipher;
-  if (Status status =
-          Check("Esys_RSA_Encrypt",
-                Esys_RSA_Encrypt(tpm.ctx(), key.get().tr, tpm.session.get().tr, ESYS_TR_NONE,
-                                 ESYS_TR_NONE, &message, &scheme, &label, cipher.out()));
+  // An exponent of 0 in a TPM key means the default, 65537.
+  const uint32_t exponent =
+      key.parameters.rsaDetail.exponent != 0 ? key.parameters.rsaDetail.exponent : 65537;
+  uint8_t cipher[kMaxCipherSize];
+  std::size_t cipherSize = 0;
+  if (Status status = keymgr::crypto::RsaOaepSha256Encrypt(
+          {key.unique.rsa.buffer, modulusSize}, exponent, {data, length}, cipher, &cipherSize);
       !status.ok()) {
     return status;
   }
-  const auto size = std::min<std::size_t>(cipher.get()->size, sizeof(cipher.get()->buffer));
-  if (Status status = EncodeFragment({cipher.get()->buffer, size},
+  if (Status status = EncodeFragment({cipher, cipherSize},
                                      std::span<uint8_t, PCP_FRAGMENT_SIZE>(out, PCP_FRAGMENT_SIZE));
       !status.ok()) {
     return status;
@@ -340,8 +314,12 @@ Status Seal(const char* nameHex, const uint8_t* data, uint32_t length, uint8_t* 
   return Status();
 }
 
-Status Unseal(const char* nameHex, const char* passHex, const uint8_t* fragment, uint32_t length,
-              uint8_t* out, uint32_t* outSize) {
+// The session that carries the decryption is bound to the key: its session
+// key comes from the key's auth value, which the call has anyway, so the
+// plaintext returns encrypted without a second asymmetric operation. The
+// session ends with the command (continueSession clear).
+Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const uint8_t* fragment,
+              uint32_t length, uint8_t* out, uint32_t* outSize) {
   if (nameHex == nullptr || passHex == nullptr || fragment == nullptr || out == nullptr ||
       outSize == nullptr) {
     return Refused("pcp_decryptDataFragment");
@@ -350,42 +328,70 @@ Status Unseal(const char* nameHex, const char* passHex, const uint8_t* fragment,
   if (Status status = DecodeFragment({fragment, length}, &sealed); !status.ok()) {
     return status;
   }
-  Connection tpm;
-  PersistentObject key;
-  if (Status status = Connect(tpm); !status.ok()) {
+  const uint32_t handle = HandleOfName(nameHex);
+  ESYS_TR tr = ESYS_TR_NONE;
+  if (Status status = Run(
+          tpm, "Esys_TR_FromTPMPublic",
+          [&] {
+            return Esys_TR_FromTPMPublic_Async(tpm.ctx(), handle, ESYS_TR_NONE, ESYS_TR_NONE,
+                                               ESYS_TR_NONE);
+          },
+          [&] { return Esys_TR_FromTPMPublic_Finish(tpm.ctx(), &tr); });
+      !status.ok()) {
     return status;
   }
-  if (Status status = OpenOwnKey(tpm, HandleOfName(nameHex), key); !status.ok()) {
-    return status;
-  }
+  PersistentObject key(tpm.Object(tr));
   {
     TPM2B_AUTH auth{};
     ScopeExit wipeAuth([&] { OPENSSL_cleanse(&auth, sizeof(auth)); });
     auth.size = kDigestSize;
     (void)Md5OfString(passHex, auth.buffer);  // always 0
-    if (Status status = Check("Esys_TR_SetAuth", Esys_TR_SetAuth(tpm.ctx(), key.get().tr, &auth));
+    if (Status status = Check("Esys_TR_SetAuth", Esys_TR_SetAuth(tpm.ctx(), tr, &auth));
         !status.ok()) {
       return status;
     }
   }
-  // The plaintext is the first response parameter: the TPM returns it
-  // encrypted under the salted session.
-  if (Status status = StartSaltedSession(tpm, TPMA_SESSION_ENCRYPT); !status.ok()) {
+  TPMT_SYM_DEF symmetric{};
+  symmetric.algorithm = TPM2_ALG_AES;
+  symmetric.keyBits.aes = 128;
+  symmetric.mode.aes = TPM2_ALG_CFB;
+  ESYS_TR bound = ESYS_TR_NONE;
+  if (Status status = Run(
+          tpm, "Esys_StartAuthSession",
+          [&] {
+            return Esys_StartAuthSession_Async(tpm.ctx(), ESYS_TR_NONE, tr, ESYS_TR_NONE,
+                                               ESYS_TR_NONE, ESYS_TR_NONE, nullptr, TPM2_SE_HMAC,
+                                               &symmetric, TPM2_ALG_SHA256);
+          },
+          [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), &bound); });
+      !status.ok()) {
+    return status;
+  }
+  TransientObject session(tpm.Object(bound));
+  if (Status status =
+          Check("Esys_TRSess_SetAttributes",
+                Esys_TRSess_SetAttributes(tpm.ctx(), bound, TPMA_SESSION_ENCRYPT, 0xff));
+      !status.ok()) {
     return status;
   }
   TPM2B_PUBLIC_KEY_RSA cipher{};
   cipher.size = static_cast<uint16_t>(sealed.size());
   std::memcpy(cipher.buffer, sealed.data(), sealed.size());
-  TPMT_RSA_DECRYPT scheme = OaepSha256();
+  const TPMT_RSA_DECRYPT scheme = OaepSha256();
   TPM2B_DATA label{};
   SecretOutput<TPM2B_PUBLIC_KEY_RSA> message;
-  if (Status status =
-          Check("Esys_RSA_Decrypt",
-                Esys_RSA_Decrypt(tpm.ctx(), key.get().tr, tpm.session.get().tr, ESYS_TR_NONE,
-                                 ESYS_TR_NONE, &cipher, &scheme, &label, message.out()));
+  if (Status status = Run(
+          tpm, "Esys_RSA_Decrypt",
+          [&] {
+            return Esys_RSA_Decrypt_Async(tpm.ctx(), tr, bound, ESYS_TR_NONE, ESYS_TR_NONE, &cipher,
+                                          &scheme, &label);
+          },
+          [&] { return Esys_RSA_Decrypt_Finish(tpm.ctx(), message.out()); });
       !status.ok()) {
     return status;
   }
+  // The TPM ended the session with the command, and ESAPI forgot it.
+  (void)session.release();
   if (message.get()->size > *outSize || message.get()->size > sizeof(message.get()->buffer)) {
     return Refused("pcp_decryptDataFragment");
   }
@@ -394,36 +400,81 @@ Status Unseal(const char* nameHex, const char* passHex, const uint8_t* fragment,
   return Status();
 }
 
-// Result reduces a status to the key manager's result.
-int Result(const Status& status) {
+// The connection held by pcp_hold_connection, opened by the first call that
+// needs it.
+bool g_holding = false;
+std::optional<Connection> g_held;
+
+// OnTpm runs |op| on the held connection, or on one of its own that closes
+// when the call ends. SIGPIPE stays blocked while the TPM is used.
+template <class Op>
+int OnTpm(Op op) {
+  SigpipeBlock sigpipe;
+  std::optional<Connection> own;
+  std::optional<Connection>& slot = g_holding ? g_held : own;
+  if (!slot) {
+    slot.emplace();
+    if (!Connect(*slot).ok()) {
+      slot.reset();
+      return 1;
+    }
+  }
+  const Status status = op(*slot);
+  // A connection that lost its TPM is given up; the next call opens another.
+  if (slot->broken) {
+    slot.reset();
+  }
   return status.ok() ? 0 : 1;
 }
 
 }  // namespace
 
+void pcp_hold_connection(void) {
+  g_holding = true;
+}
+
+void pcp_release_connection(void) {
+  SigpipeBlock sigpipe;
+  g_held.reset();
+  g_holding = false;
+}
+
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
-  return count == 0 ? 0 : Result(DrawRandom(count, dst));
+  if (count == 0) {
+    return 0;
+  }
+  return OnTpm([&](Connection& tpm) { return DrawRandom(tpm, count, dst); });
+}
+
+int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn) {
+  return OnTpm([&](Connection& tpm) { return DrawEntropy(tpm, count, dst, drawn); });
 }
 
 int pcp_create_key(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint32_t bits,
                    uint32_t) {
-  return Result(CreateKey(nameDigest, passwordDigest, bits));
+  return OnTpm([&](Connection& tpm) { return CreateKey(tpm, nameDigest, passwordDigest, bits); });
 }
 
 int pcp_delete_key(const uint8_t* nameDigest, uint32_t) {
-  return Result(DeleteKey(nameDigest));
+  return OnTpm([&](Connection& tpm) { return DeleteKey(tpm, nameDigest); });
 }
 
 int pcp_evict_stale_keys(const uint8_t* keepNameDigest) {
-  return Result(EvictStaleKeys(keepNameDigest));
+  return OnTpm([&](Connection& tpm) { return EvictStaleKeys(tpm, keepNameDigest); });
 }
 
 int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
                             uint8_t* out, uint32_t* outSize) {
-  return Result(Seal(nameHex, data, length, out, outSize));
+  return OnTpm([&](Connection& tpm) { return Seal(tpm, nameHex, data, length, out, outSize); });
 }
 
 int pcp_decryptDataFragment(const char* nameHex, const char* passHex, const uint8_t* fragment,
                             uint32_t length, uint8_t* out, uint32_t* outSize) {
-  return Result(Unseal(nameHex, passHex, fragment, length, out, outSize));
+  return OnTpm([&](Connection& tpm) {
+    return Unseal(tpm, nameHex, passHex, fragment, length, out, outSize);
+  });
+}
+
+int pcp_persist_srk(void) {
+  return OnTpm([](Connection& tpm) { return PersistSrk(tpm); });
 }

@@ -1,16 +1,25 @@
-// The TPM connection of the platform key manager over tpm2-tss ESAPI: the
-// handles it owns, how it is opened, and its storage primary and sessions.
-// Private to platform/.
+// The TPM connection of the platform key manager over tpm2-tss: the handles
+// it owns, the deadline of every command, the storage primary and the
+// sessions. Private to platform/.
 #pragma once
 
 #include <openssl/crypto.h>
+#include <signal.h>
 #include <tss2/tss2_esys.h>
+#include <tss2/tss2_sys.h>
 #include <tss2/tss2_tctildr.h>
+
+#include <chrono>
+#include <cstdint>
 
 #include "util/owned.h"
 #include "util/status.h"
 
 namespace keymgr::tpm {
+
+// The persistent handle of the storage root key in TCG's provisioning
+// guidance; systemd and tpm2-tss FAPI use it too.
+inline constexpr std::uint32_t kSrkHandle = 0x81000001u;
 
 // TssFailure names a failed tpm2-tss call once, with the decoded code, on
 // request (KEYMGR_DEBUG).
@@ -56,20 +65,44 @@ using Output = Owned<T*, FreeOutput<T>>;
 template <class T>
 using SecretOutput = Owned<T*, FreeSecretOutput<T>>;
 
-// Connection is one connection to the TPM and what a call derives from it.
-// Its members go in reverse order: the session and the primary are flushed
-// before ESAPI and then the transport are finalised. After a transport error
-// ESAPI refuses further commands and the flushes fail; the kernel's resource
-// manager then drops what the connection held when it closes, and without
-// one the next connection flushes it (see Connect).
+// SigpipeBlock keeps SIGPIPE blocked on this thread while it lives, and then
+// drains one that the TPM transport raised: a peer that hangs up fails the
+// call with EPIPE instead of ending the process. The process's disposition
+// of SIGPIPE is never touched, and one that was already pending is left.
+class SigpipeBlock {
+ public:
+  SigpipeBlock();
+  ~SigpipeBlock();
+  SigpipeBlock(const SigpipeBlock&) = delete;
+  SigpipeBlock& operator=(const SigpipeBlock&) = delete;
+
+ private:
+  sigset_t saved_;
+  bool pendingBefore_ = false;
+};
+
+// Connection is one connection to the TPM and what its calls derive from it.
+// Its members go in reverse order: the session and the parent are flushed or
+// closed before ESAPI and then the transport are finalised.
 struct Connection {
   TctiContext tcti;
   EsysContext esys;
-  TransientObject primary;
-  TransientObject session;
+  TSS2_SYS_CONTEXT* sys = nullptr;  // ESAPI's own, for the raw commands
+  // Set when a command missed its deadline or the transport failed: ESAPI is
+  // then mid-command, so nothing more is sent on this connection.
+  bool broken = false;
+  std::int32_t waitMs = 0;  // the wait of the command under way
+  TransientObject primary;  // the storage primary this connection created, or
+  PersistentObject srk;     // the persistent SRK it found
+  TransientObject session;  // salted by the parent, for secrets on the bus
+  // The public area of the key this connection created last: sealing to it
+  // needs no command.
+  std::uint32_t createdHandle = 0;
+  TPM2B_PUBLIC createdPublic{};
 
   ESYS_CONTEXT* ctx() const { return esys.get(); }
   EsysObject Object(ESYS_TR tr) const { return {esys.get(), tr}; }
+  ESYS_TR Parent() const { return srk ? srk.get().tr : primary.get().tr; }
 };
 
 // HasResourceManager tells whether |tcti| reaches the TPM through a resource
@@ -77,17 +110,62 @@ struct Connection {
 // connection and flushes what it leaves behind.
 bool HasResourceManager(const char* tcti);
 
-// Connect opens the TPM on the build's transport and starts it ("already
-// started" is fine). Without a resource manager it first flushes every
-// transient object and session the TPM holds.
+// Connect opens the build's transport and ESAPI on it. It sends nothing: a
+// TPM that still needs TPM2_Startup gets it with the first command.
 Status Connect(Connection& tpm);
 
-// StartSaltedSession creates the storage primary and opens an HMAC session
-// salted by it, with AES-128-CFB parameter encryption in the direction(s) of
-// |attributes| (TPMA_SESSION_DECRYPT: first command parameter;
-// TPMA_SESSION_ENCRYPT: first response parameter). The salt travels under
-// the primary's public key, so the session key, and the secrets it covers,
-// never cross the bus in clear.
-Status StartSaltedSession(Connection& tpm, TPMA_SESSION attributes);
+// Run sends one command and names its failure |call|. |send| starts the
+// command (an ESAPI _Async call, or a raw command's preparation and send) and
+// |finish| collects the answer, waiting at most tpm.waitMs; the command fails
+// at the deadline. A TPM that was not started is started and the command
+// sent again; without a resource manager, a TPM whose slots are full of what
+// a dead process left is cleared and the command sent again.
+template <class Send, class Finish>
+Status Run(Connection& tpm, const char* call, Send send, Finish finish);
+
+// SendOnce and Recover are Run's parts, out of line.
+TSS2_RC SendOnce(Connection& tpm, TSS2_RC (*send)(void*), TSS2_RC (*finish)(void*), void* call);
+bool Recover(Connection& tpm, TSS2_RC rc);
+
+template <class Send, class Finish>
+Status Run(Connection& tpm, const char* call, Send send, Finish finish) {
+  struct Pair {
+    Send& send;
+    Finish& finish;
+  } pair{send, finish};
+  TSS2_RC rc = TSS2_RC_SUCCESS;
+  for (int attempt = 0; attempt < 3; ++attempt) {
+    rc = SendOnce(
+        tpm, [](void* p) -> TSS2_RC { return static_cast<Pair*>(p)->send(); },
+        [](void* p) -> TSS2_RC { return static_cast<Pair*>(p)->finish(); }, &pair);
+    if (!Recover(tpm, rc)) {
+      break;
+    }
+  }
+  return Check(call, rc);
+}
+
+// ReadPublic reads the public area of the object at |handle| and checks it
+// against the name the TPM gives for it.
+Status ReadPublic(Connection& tpm, TPM2_HANDLE handle, TPM2B_PUBLIC* area);
+
+// EvictPersistent evicts the persistent object at |handle| (owner auth).
+Status EvictPersistent(Connection& tpm, TPM2_HANDLE handle);
+
+// UseParent makes the storage parent of the keys available, once per
+// connection: the persistent SRK when it is there with the standard storage
+// template, else a primary created from that template (the same key).
+Status UseParent(Connection& tpm);
+
+// UseSaltedSession makes the connection's HMAC session available, salted by
+// the parent, and sets its parameter encryption to |attributes|
+// (TPMA_SESSION_DECRYPT: the command's first parameter; TPMA_SESSION_ENCRYPT:
+// the response's). The salt travels under the parent's public key, so the
+// session key, and the secrets it covers, never cross the bus in clear.
+Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes);
+
+// PersistSrk makes the standard SRK persistent at kSrkHandle, or finds it
+// there already.
+Status PersistSrk(Connection& tpm);
 
 }  // namespace keymgr::tpm

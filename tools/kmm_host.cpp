@@ -2,6 +2,7 @@
 //   kmm-host OPTION [LOG_FLAG]   KeyManage(OPTION, LOG_FLAG); exit 0 when a
 //                                context came back, 1 when none did
 //   kmm-host dmsetup             CheckDmsetupDigest; exit 0 on a match
+//   kmm-host srk                 KmmPersistSrk; exit 0 when the SRK is persistent
 #include <kmm/kmm.h>
 
 #include <cerrno>
@@ -15,7 +16,7 @@ namespace {
 constexpr int kUsageStatus = 2;
 
 int Usage() {
-  std::fprintf(stderr, "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup\n");
+  std::fprintf(stderr, "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup | kmm-host srk\n");
   return kUsageStatus;
 }
 
@@ -41,6 +42,9 @@ int main(int argc, char** argv) {
     int result = CheckDmsetupDigest();
     std::fflush(stdout);
     return result == 0 ? 0 : 1;
+  }
+  if (argc == 2 && std::strcmp(argv[1], "srk") == 0) {
+    return KmmPersistSrk() == 0 ? 0 : 1;
   }
   int option = 0;
   int logFlag = 0;

@@ -75,14 +75,21 @@ KeyContext* KeyManage(int32_t option, int logFlag);
 #define KMM_ENTROPY_GETRANDOM 2
 
 /* KmmSeedRandom fills the whole state of the C library generator (random())
- * with fresh random bytes: the TPM's, mixed with the kernel's getrandom, or
- * the kernel's alone when the TPM cannot be reached. The module never seeds
+ * with fresh random bytes: the kernel's getrandom mixed with the TPM's, or
+ * either alone when the other cannot be had. The module never seeds
  * the generator itself and builds the seed key from it: a host that skips
  * this call before KeyManage(KMM_OPTION_REGENERATE, ...) gets a guessable
  * secret key. Returns KMM_ENTROPY_TPM or KMM_ENTROPY_GETRANDOM, the source
  * used, or -1 when neither answered (the generator is then left as it was).
  * It replaces whatever seeding the host did before. */
 int KmmSeedRandom(void);
+
+/* KmmPersistSrk makes the TPM's standard storage root key persistent at
+ * 0x81000001 (ECC P-256 under the owner hierarchy, TCG's storage template),
+ * or finds it there. Regenerations then create their key under it instead of
+ * creating a primary each time. Returns 0, or -1 when the TPM cannot be
+ * reached or something else occupies the handle. */
+int KmmPersistSrk(void);
 
 /* CheckDmsetupDigest compares the SHA-256 of the disk-mapper tool with the
  * built-in expected digest. Returns 0 on a match, -1 otherwise. */

@@ -88,13 +88,13 @@ TEST(PcpTpm, RoundTripRefusalsAndNoSecretOnTheBus) {
 // or swept with the stale keys.
 TEST(PcpTpm, OnlyOwnKeysAreEvicted) {
   const std::string tcti = KEYMGR_TCTI, context = KEYMGR_ROOT "/run/foreign.ctx";
-  const uint8_t foreign[16] = {0x00, 0x12, 0x34};  // its handle is 0x81001234
+  const uint8_t foreign[16] = {0x00, 0x12, 0x34};  // its handle is 0x81021234
   ASSERT_EQ(keymgr::test::Run(
                 {"tpm2_createprimary", "-C", "o", "-G", "rsa2048", "-c", context, "-T", tcti})
                 .status,
             0);
   ASSERT_EQ(
-      keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", context, "0x81001234", "-T", tcti})
+      keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", context, "0x81021234", "-T", tcti})
           .status,
       0);
   const std::vector<std::string> getcap{TPM2_GETCAP_BIN, "handles-persistent", "-T", tcti};
@@ -107,5 +107,5 @@ TEST(PcpTpm, OnlyOwnKeysAreEvicted) {
   EXPECT_EQ(pcp_delete_key(kept.digest, 0), 0);
   EXPECT_NE(pcp_delete_key(stale.digest, 0), 0) << "swept already";
   EXPECT_EQ(keymgr::test::Run(getcap).out, withForeign);
-  keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", "0x81001234", "-T", tcti});
+  keymgr::test::Run({"tpm2_evictcontrol", "-C", "o", "-c", "0x81021234", "-T", tcti});
 }

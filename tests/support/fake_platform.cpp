@@ -77,6 +77,15 @@ int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length, const void*
   return WriteEEPROM_Bytes_Sema(device, offset, length, src);
 }
 
+void pcp_hold_connection(void) {}
+void pcp_release_connection(void) {}
+int pcp_persist_srk(void) {
+  return 0;
+}
+int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn) {
+  *drawn = count < 32 ? count : 32;
+  return pcp_getRandomBytes(*drawn, dst);
+}
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
   if (Fails(kRandom)) {
     return 1;
