@@ -47,7 +47,7 @@ EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
 
 // HashEntry computes the digest of one entry and prints the failure line.
 bool HashEntry(const EntryBuffer& entry, Digest& digest) {
-  switch (keymgr::ComputeFileDigest(entry.data(), "r", digest)) {
+  switch (keymgr::ComputeFileDigest(entry.data(), digest)) {
     case keymgr::FileDigestResult::kOk:
       return true;
     case keymgr::FileDigestResult::kStatusFailure:

@@ -20,7 +20,7 @@ int CheckDmsetupDigest(void) {
   VKT_DTC_GetConstant(DTC_CONST_DMSETUP_DIGEST, &expected, &expectedLength);
 
   keymgr::Secret<keymgr::kFileDigestSize> digest;
-  switch (keymgr::ComputeFileDigest(keymgr::kDmsetupPath, "rb", digest.bytes)) {
+  switch (keymgr::ComputeFileDigest(keymgr::kDmsetupPath, digest.bytes)) {
     case keymgr::FileDigestResult::kStatusFailure:
       std::printf("file[%s] status error : %d\n", keymgr::kDmsetupPath, errno);
       return -1;
