@@ -224,6 +224,7 @@ TEST(KeymgrTest, ThreadedRunsMatchOneAtATime) {
         t::WriteFile(kLog, "OLD\n");
         const auto run =
             t::Run({"/usr/bin/env", "KEYMGR_HASH_THREADS=" + std::to_string(threads), K, command});
+        EXPECT_EQ(run.err, "") << command << threads;  // where a sanitizer reports
         seen[threads > 1] = std::to_string(run.status) + run.out + "|" + *t::ReadFile(kLog) + "|" +
                             t::Hex(*t::ReadFile(kDigests));
       }
