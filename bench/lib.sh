@@ -5,17 +5,34 @@ build_setting() {
   sed -n "s/^$2:[A-Z]*=//p" "$1/CMakeCache.txt"
 }
 
-# median_ms RUNS CMD...: runs CMD RUNS times (it must succeed, output
-# discarded) and prints the median wall time in milliseconds.
+# wall_ms CMD...: runs CMD once (it must succeed, output discarded) and
+# prints its wall time in milliseconds.
+wall_ms() {
+  # The clock in microseconds, read without starting a process.
+  local start=${EPOCHREALTIME/[.,]/} end
+  "$@" >/dev/null || { echo "failed: $*" >&2; exit 1; }
+  end=${EPOCHREALTIME/[.,]/}
+  awk -v us=$((end - start)) 'BEGIN { printf "%.3f\n", us / 1000 }'
+}
+
+# median prints the median of the numbers on standard input, one a line.
+median() {
+  sort -g | awk '{ t[NR] = $1 } END { print t[int((NR + 1) / 2)] }'
+}
+
+# median_ms RUNS CMD...: the median of RUNS runs of wall_ms CMD.
 median_ms() {
-  local runs=$1 times=() start end
+  local runs=$1
   shift
   for _ in $(seq "$runs"); do
-    start=$(date +%s%N)
-    "$@" >/dev/null || { echo "failed: $*" >&2; exit 1; }
-    end=$(date +%s%N)
-    times+=($(( (end - start) / 1000 )))
-  done
-  printf '%s\n' "${times[@]}" | sort -n |
-    awk '{ t[NR] = $1 } END { printf "%.1f\n", t[int((NR + 1) / 2)] / 1000 }'
+    wall_ms "$@"
+  done | median
+}
+
+# peak_mib CMD...: runs CMD once under /usr/bin/time and prints its peak
+# resident memory in MiB.
+peak_mib() {
+  # time writes to standard error; the command's output is discarded.
+  /usr/bin/time -f "%M" "$@" 2>&1 >/dev/null | tail -n 1 |
+    awk '{ printf "%.1f\n", $1 / 1024 }'
 }

@@ -4,88 +4,147 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
-#include <cstdint>
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <limits>
 
-#include "crypto/hash.h"
-#include "util/owned.h"
-#include "util/secure.h"
+#include "crypto/internal.h"
+#include "util/io.h"
 
 namespace keymgr {
 
 namespace {
 
-// OpenRegular opens |path| without blocking and only when it is a regular
-// file: a FIFO with no writer would otherwise block the boot run for ever,
-// and devices or directories have no meaningful contents to hash.
-File OpenRegular(const char* path, const char* mode) {
-  int fd = ::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
-  if (fd < 0) {
-    return File();
-  }
-  struct stat st {};
-  if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
-    int saved = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
-    ::close(fd);
-    errno = saved;
-    return File();
-  }
-  std::FILE* f = ::fdopen(fd, mode);
-  if (f == nullptr) {
-    int saved = errno;
-    ::close(fd);
-    errno = saved;
-  }
-  return File(f);
+// Page alignment lets the kernel copy whole pages into the buffer.
+constexpr std::size_t kBufferAlignment = 4096;
+static_assert(kFileReadChunk % kBufferAlignment == 0);
+// How much of a file opened ahead of its turn the kernel is asked to read in.
+constexpr std::size_t kSoonBytes = 4 * kFileReadChunk;
+
+// ReadUpTo reads up to |size| bytes into |buffer| and returns how many came:
+// fewer only at the end of the file or on a read error.
+std::size_t ReadUpTo(int fd, std::uint8_t* buffer, std::size_t size) {
+  std::size_t got = 0;
+  (void)MoveAll(
+      [&](std::size_t done, std::size_t left) {
+        const ssize_t moved = ::read(fd, buffer + done, left);
+        if (moved > 0) {
+          got = done + static_cast<std::size_t>(moved);
+        }
+        return moved;
+      },
+      size);
+  return got;
 }
 
-void FreeMemory(void* memory) {
-  std::free(memory);
+// Ready takes the hasher's buffer and context at their first use and starts
+// a digest.
+Status Ready(FileHasher& hasher) {
+  if (!hasher.buffer) {
+    hasher.buffer.reset(
+        static_cast<std::uint8_t*>(std::aligned_alloc(kBufferAlignment, kFileReadChunk)));
+  }
+  if (!hasher.context) {
+    hasher.context.reset(EVP_MD_CTX_new());
+  }
+  // A hash that cannot run fails like a buffer that cannot be had.
+  if (!hasher.buffer || !hasher.context) {
+    return ErrnoFailure("open", ENOMEM);
+  }
+  return EVP_DigestInit_ex(hasher.context.get(), EVP_sha256(), nullptr) == 1
+             ? Status()
+             : crypto::OpensslFailure("EVP_DigestInit_ex");
 }
 
 }  // namespace
 
-Status ComputeFileDigest(const char* path, const char* mode,
-                         std::span<std::uint8_t, kFileDigestSize> digest) {
-  struct stat st;
-  if (::stat(path, &st) < 0) {
-    return ErrnoFailure("stat");
-  }
-  // The size is a signed 32-bit count; a file of 2 GiB or more cannot be
-  // held, so it fails like an unopenable one rather than wrapping.
-  if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max()) {
-    return ErrnoFailure("open", EFBIG);
-  }
-  const auto size = static_cast<std::int32_t>(st.st_size);
+void FileHasher::FreeBuffer(std::uint8_t* buffer) {
+  std::free(buffer);
+}
 
-  File file = OpenRegular(path, mode);
-  if (!file) {
-    return ErrnoFailure("open");
+Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
+  // Opened without blocking: a FIFO with no writer would otherwise hold the
+  // boot run for ever. Opening first and asking the descriptor for the size
+  // walks the path once; only a path that cannot be opened is stat'ed, since
+  // a failed stat, not the open, is what makes a status failure.
+  file.fd.reset(::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  if (!file.fd) {
+    const int error = errno;
+    struct stat st;
+    return ::stat(path, &st) < 0 ? ErrnoFailure("stat") : ErrnoFailure("open", error);
   }
-  using Buffer = Owned<void*, FreeMemory>;
-  Buffer buffer(std::calloc(static_cast<std::size_t>(size) + 1, 1));
-  if (!buffer) {
-    return ErrnoFailure("open", ENOMEM);
+  // The size is a signed 32-bit count: a file of 2 GiB or more fails like an
+  // unopenable one rather than wrapping. Devices and directories have no
+  // meaningful contents to hash.
+  struct stat st {};
+  int error = 0;
+  if (::fstat(file.fd.get(), &st) != 0) {
+    error = errno;
+  } else if (!S_ISREG(st.st_mode)) {
+    error = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+  } else if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max()) {
+    error = EFBIG;
   }
-  // A short read leaves zeros in place of the missing bytes.
-  std::size_t got = std::fread(buffer.get(), 1, static_cast<std::size_t>(size), file.get());
-  (void)got;
-  file.reset();
+  if (error != 0) {
+    file.fd.reset();
+    return ErrnoFailure("open", error);
+  }
+  file.size = static_cast<std::size_t>(st.st_size);
+  if (soon && file.size > 0) {
+    // Advice only: its result changes nothing.
+    (void)::posix_fadvise(file.fd.get(), 0, static_cast<off_t>(std::min(file.size, kSoonBytes)),
+                          POSIX_FADV_WILLNEED);
+  }
+  return Status();
+}
 
-  std::uint8_t out[kFileDigestSize] = {};
-  crypto::Sha256 sha;
-  if (Status status = sha.Update(buffer.get(), static_cast<std::size_t>(size)); !status.ok()) {
+Status HashOpenFile(FileHasher& hasher, FileToHash& file,
+                    std::span<std::uint8_t, kFileDigestSize> digest,
+                    const std::atomic<bool>* stop) {
+  const Descriptor fd = std::move(file.fd);
+  if (Status status = Ready(hasher); !status.ok()) {
     return status;
   }
-  if (Status status = sha.Final(out); !status.ok()) {
-    return status;
+  std::size_t left = file.size;
+  if (left > kFileReadChunk) {
+    // Doubles the kernel's read-ahead for the rest of the file.
+    (void)::posix_fadvise(fd.get(), 0, 0, POSIX_FADV_SEQUENTIAL);
+  }
+  std::uint8_t* buffer = hasher.buffer.get();
+  bool ended = false;
+  while (left > 0) {
+    if (stop != nullptr && stop->load(std::memory_order_relaxed)) {
+      return ErrnoFailure("open", ECANCELED);
+    }
+    const std::size_t want = std::min(left, kFileReadChunk);
+    const std::size_t got = ended ? 0 : ReadUpTo(fd.get(), buffer, want);
+    // Bytes missing at the end, or that could not be read, count as zeros.
+    if (got < want) {
+      std::memset(buffer + got, 0, want - got);
+      ended = true;
+    }
+    if (EVP_DigestUpdate(hasher.context.get(), buffer, want) != 1) {
+      return crypto::OpensslFailure("EVP_DigestUpdate");
+    }
+    left -= want;
+  }
+  std::uint8_t out[EVP_MAX_MD_SIZE] = {};
+  if (EVP_DigestFinal_ex(hasher.context.get(), out, nullptr) != 1) {
+    return crypto::OpensslFailure("EVP_DigestFinal_ex");
   }
   std::memcpy(digest.data(), out, kFileDigestSize);
   return Status();
+}
+
+Status ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest) {
+  FileToHash file;
+  if (Status status = OpenFileToHash(path, file, false); !status.ok()) {
+    return status;
+  }
+  FileHasher hasher;
+  return HashOpenFile(hasher, file, digest, nullptr);
 }
 
 }  // namespace keymgr

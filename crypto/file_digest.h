@@ -1,22 +1,59 @@
-// The SHA-256 digest of a listed file.
+// The SHA-256 digest of a listed file, streamed through a fixed buffer.
 #pragma once
 
+#include <openssl/evp.h>
+
+#include <atomic>
+#include <cstddef>
 #include <cstdint>
 #include <span>
 
+#include "util/owned.h"
 #include "util/status.h"
 
 namespace keymgr {
 
 inline constexpr std::size_t kFileDigestSize = 32;
 
-// ComputeFileDigest hashes the whole file at |path| with SHA-256 into
-// |digest|, opening it with |mode| ("r" or "rb"). It fails on "stat" when
-// the path cannot be examined; every other failure (cannot open, not a
-// regular file, too large, no memory) counts as an open failure. On failure
-// |digest| is left as it was. A file that shrinks after the stat is hashed as
-// if the missing bytes were zeros.
-Status ComputeFileDigest(const char* path, const char* mode,
-                         std::span<std::uint8_t, kFileDigestSize> digest);
+// Files are read this much at a time: enough that the system calls cost
+// little next to the hashing, little enough to stay in the CPU cache between
+// the read and the hash.
+inline constexpr std::size_t kFileReadChunk = 128 * 1024;
+
+// FileHasher holds what hashing reuses from one file to the next: an aligned
+// read buffer of kFileReadChunk bytes and a hash context, both taken at the
+// first use. One per thread.
+struct FileHasher {
+  static void FreeBuffer(std::uint8_t* buffer);
+  Owned<std::uint8_t*, FreeBuffer> buffer;
+  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context;
+};
+
+// A file opened for hashing, with the size that stat gave it.
+struct FileToHash {
+  Descriptor fd;
+  std::size_t size = 0;
+};
+
+// OpenFileToHash opens |path| for HashOpenFile without blocking, and only a
+// regular file below 2 GiB. It fails on "stat" when the path cannot be
+// examined; every other failure (cannot open, not a regular file, too large)
+// counts as an open failure. |soon| tells the kernel that the file will be
+// read shortly, so that it can start reading it in now.
+Status OpenFileToHash(const char* path, FileToHash& file, bool soon);
+
+// HashOpenFile hashes |file| with SHA-256 into |digest| and closes it. The
+// file streams through |hasher|'s buffer, so memory does not grow with the
+// file. Exactly the size that stat gave is hashed: bytes missing because the
+// file shrank count as zeros, bytes added since are not hashed. On failure
+// |digest| is left as it was. When |stop| becomes true the file is abandoned
+// part way (an open failure, ECANCELED), so that a run that has already
+// failed does not wait for it.
+Status HashOpenFile(FileHasher& hasher, FileToHash& file,
+                    std::span<std::uint8_t, kFileDigestSize> digest, const std::atomic<bool>* stop);
+
+// ComputeFileDigest opens and hashes the file at |path| with a hasher of its
+// own: the digest of a single file, failing as OpenFileToHash does.
+Status ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest);
 
 }  // namespace keymgr

@@ -21,8 +21,7 @@ int CheckDmsetupDigest(void) {
   FetchConstant(DTC_CONST_DMSETUP_DIGEST, &expected, &expectedLength);
 
   keymgr::Secret<keymgr::kFileDigestSize> digest;
-  if (const keymgr::Status status =
-          keymgr::ComputeFileDigest(keymgr::kDmsetupPath, "rb", digest.bytes);
+  if (const keymgr::Status status = keymgr::ComputeFileDigest(keymgr::kDmsetupPath, digest.bytes);
       !status.ok()) {
     // The messages carry errno, which the failure keeps as its code.
     std::printf(status.Is("stat") ? "file[%s] status error : %d\n" : "file[%s] open error : %d\n",

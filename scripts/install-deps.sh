@@ -8,7 +8,7 @@ packages=(
   libssl-dev openssl
   libgtest-dev
   libtss2-dev libtss2-tcti-swtpm0 tpm2-tools swtpm swtpm-tools
-  valgrind clang-format strace
+  valgrind clang-format strace time
 )
 
 missing=()

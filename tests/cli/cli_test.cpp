@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <fstream>
 #include <functional>
 
 #include "keymgr_build_config.h"
@@ -161,6 +162,58 @@ TEST(KeymgrTest, KilledHashLeavesTheOldOrTheNewDigestFile) {
     }
     const auto boot = t::Run({K});
     EXPECT_EQ(boot.out, kOff + (*t::ReadFile(kDigests) == fresh ? "BN=OK\n" : "BN=FAIL\n"));
+  }
+}
+
+// Runs with one hashing thread and with four print, log and leave the same,
+// failures included; the boot outcome is also checked on its own, so that a
+// fault common to both is caught. Every fifth file spans several reads and
+// goes to the workers; the caller hashes the others.
+TEST(KeymgrTest, ThreadedRunsMatchOneAtATime) {
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN;
+  const auto path = [](int i) { return t::InRoot("/h/" + std::to_string(i)); };
+  const auto grow = [&](int i) { std::ofstream(path(i), std::ios::app) << "more"; };
+  const std::pair<std::string, std::function<void()>> cases[] = {
+      {"intact", [] {}},
+      {"first corrupted", Put(path(0), "x")},
+      {"middle corrupted", Put(path(31), "x")},
+      {"last corrupted", Put(path(59), "x")},
+      {"missing", Put(path(22))},
+      {"large shrinks", [&] { fs::resize_file(path(10), 1000); }},
+      {"large grows", [&] { grow(15); }},
+      {"small grows", [&] { grow(16); }},
+      {"fifo", [&] { fs::remove(path(25)), mkfifo(path(25).c_str(), 0600); }},
+      {"folder", [&] { fs::remove(path(35)), fs::create_directory(path(35)); }},
+  };
+  for (const auto& [name, change] : cases) {
+    SCOPED_TRACE(name);
+    t::ResetSandbox();
+    t::MakeEeprom(0x42, 0);
+    std::string list;
+    for (int i = 0; i < 60; ++i) {
+      t::WriteFile(path(i), std::string(i % 5 == 0 ? 300000 + i : 10 + i, char('a' + i % 26)));
+      list += path(i) + "\n";
+    }
+    t::WriteFile(kManifest, list);
+    t::Run({"/usr/bin/env", "KEYMGR_HASH_THREADS=1", K, "hash"});
+    change();
+    const auto digests = t::ReadFile(kDigests);
+    for (const char* command : {"", "log", "hash"}) {
+      std::string seen[2];
+      for (int threads : {1, 4}) {
+        t::WriteFile(kDigests, *digests);
+        t::WriteFile(kLog, "OLD\n");
+        const auto run =
+            t::Run({"/usr/bin/env", "KEYMGR_HASH_THREADS=" + std::to_string(threads), K, command});
+        EXPECT_EQ(run.err, "") << command << threads;  // where a sanitizer reports
+        seen[threads > 1] = std::to_string(run.status) + run.out + "|" + *t::ReadFile(kLog) + "|" +
+                            t::Hex(*t::ReadFile(kDigests));
+      }
+      EXPECT_EQ(seen[0], seen[1]) << command;
+      if (*command != 'h') {
+        EXPECT_EQ(t::ReadFile(kLog), name == "intact" ? "BN=OK\n" : "BN=FAIL\n") << command;
+      }
+    }
   }
 }
 

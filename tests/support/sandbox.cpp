@@ -88,10 +88,12 @@ RunResult Run(const std::vector<std::string>& argv) {
 }
 
 // StraceArgs puts argv under strace with |options|. With seccomp-bpf the
-// program stops only at the traced calls, which keeps long runs fast.
+// program stops only at the traced calls, which keeps long runs fast. -qq
+// keeps the exit of a thread out of the log: printed while another thread is
+// in a traced call, it would split that call's line in two.
 std::vector<std::string> StraceArgs(std::vector<std::string> options,
                                     const std::vector<std::string>& argv) {
-  options.insert(options.begin(), {"strace", "--seccomp-bpf", "-f"});
+  options.insert(options.begin(), {"strace", "--seccomp-bpf", "-qq", "-f"});
   options.insert(options.end(), argv.begin(), argv.end());
   return options;
 }
