@@ -31,26 +31,47 @@ using EntryBuffer = std::array<char, keymgr::kPathBufferSize>;
 
 // The widest entry the path buffer can hold with its terminator.
 static_assert(keymgr::kPathBufferSize == 100, "the entry format below reads 99 characters");
-constexpr char kEntryFormat[] = "%99s";
+// White space, then an entry of up to 99 characters; the positions around
+// the entry tell its length.
+constexpr char kEntryFormat[] = " %n%99s%n";
 
-enum class EntryRead { kEntry, kEnd, kTooLong };
+enum class EntryRead {
+  kEntry,
+  kEnd,
+  kTooLong,    // does not fit the path buffer
+  kNul,        // holds a NUL byte, which would cut the path short
+  kReadError,  // the manifest could not be read on
+};
 
 // ReadEntry reads the next white-space separated manifest entry. An entry
 // that does not fit the path buffer is consumed to its end and returned as
-// too long, which fails it like an entry that cannot be hashed. Nothing is
-// printed here: entries are read ahead of their turn.
+// too long. Too long, one with a NUL byte and a read error each fail the
+// run; none is taken for the end of the manifest. Nothing is printed here:
+// entries are read ahead of their turn.
 EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
-  if (std::fscanf(manifest, kEntryFormat, entry.data()) != 1) {
-    return EntryRead::kEnd;
+  int start = 0;
+  int end = 0;
+  if (std::fscanf(manifest, kEntryFormat, &start, entry.data(), &end) != 1) {
+    return std::ferror(manifest) ? EntryRead::kReadError : EntryRead::kEnd;
   }
   int next = std::getc(manifest);
-  if (next == EOF || std::isspace(next)) {
-    return EntryRead::kEntry;
-  }
+  bool tooLong = false;
   while (next != EOF && !std::isspace(next)) {
+    tooLong = true;
     next = std::getc(manifest);
   }
-  return EntryRead::kTooLong;
+  if (std::ferror(manifest)) {
+    return EntryRead::kReadError;
+  }
+  if (tooLong) {
+    return EntryRead::kTooLong;
+  }
+  return std::strlen(entry.data()) == static_cast<std::size_t>(end - start) ? EntryRead::kEntry
+                                                                            : EntryRead::kNul;
+}
+
+void PrintOpenError(const char* path) {
+  DebugPrint("%s open error!!!\n", path);
 }
 
 void PrintTooLong(const EntryBuffer& entry) {
@@ -281,34 +302,61 @@ const Job& HashAhead::Next() {
   return head;
 }
 
-// NextHashed returns the next entry with its digest, or null at the end of
-// the manifest or at the first entry that fails, whose line it prints and
-// which sets |failed|.
-const Job* NextHashed(HashAhead& ahead, int& failed) {
-  const Job& job = ahead.Next();
-  switch (job.read) {
-    case EntryRead::kEnd:
-      return nullptr;
+// How a pass over the manifest ended.
+enum Outcome {
+  kAllPassed = 0,
+  kEntryFailed = 1,  // an entry failed: BN=FAIL
+  kUnreadable = 2,   // the manifest or the digest file could not be read on
+};
+
+// PrintEntryFailure prints the line of an entry that cannot be hashed, and
+// says how the pass ends.
+Outcome PrintEntryFailure(EntryRead read, const EntryBuffer& entry) {
+  switch (read) {
     case EntryRead::kTooLong:
-      PrintTooLong(job.entry);
-      failed = 1;
-      return nullptr;
+      PrintTooLong(entry);
+      return kEntryFailed;
+    case EntryRead::kNul:
+      DebugPrint("file[%s] open error!!\n", entry.data());
+      return kEntryFailed;
+    case EntryRead::kReadError:
+      PrintOpenError(keymgr::kManifestPath);
+      return kUnreadable;
     case EntryRead::kEntry:
+    case EntryRead::kEnd:
       break;
   }
+  return kAllPassed;
+}
+
+// NextHashed returns the next entry with its digest, or null at the end of
+// the manifest or at the first entry that fails, whose line it prints and
+// which sets |outcome|.
+const Job* NextHashed(HashAhead& ahead, Outcome& outcome) {
+  const Job& job = ahead.Next();
+  if (job.read != EntryRead::kEntry) {
+    outcome = PrintEntryFailure(job.read, job.entry);
+    return nullptr;
+  }
   if (!PrintHashFailure(job.result, job.entry)) {
-    failed = 1;
+    outcome = kEntryFailed;
     return nullptr;
   }
   return &job;
 }
 
 // ReadRecord reads the next digest record. Missing bytes stay zero, so a
-// short digest file fails the comparison instead of being reported.
-void ReadRecord(std::FILE* digests, Digest& record) {
+// short digest file fails the comparison instead of being reported; a file
+// that cannot be read is reported and returns false.
+bool ReadRecord(std::FILE* digests, Digest& record) {
   record.fill(0);
-  std::size_t got = std::fread(record.data(), 1, record.size(), digests);
+  const std::size_t got = std::fread(record.data(), 1, record.size(), digests);
   (void)got;
+  if (std::ferror(digests)) {
+    PrintOpenError(keymgr::kDigestFilePath);
+    return false;
+  }
+  return true;
 }
 
 void PrintDigest(const char* label, const Digest& digest) {
@@ -329,10 +377,6 @@ void PrintOutcome(const EntryBuffer& entry, bool matches) {
 
 bool SameDigest(const Digest& a, const Digest& b) {
   return std::memcmp(a.data(), b.data(), kFileDigestSize) == 0;
-}
-
-void PrintOpenError(const char* path) {
-  DebugPrint("%s open error!!!\n", path);
 }
 
 // OpenManifest opens the manifest, printing its open error on failure.
@@ -382,9 +426,14 @@ int HashManifest() {
   int result = manifest ? 0 : 1;
   if (manifest) {
     HashAhead ahead(manifest.get());
-    int failed = 0;
-    while (const Job* job = NextHashed(ahead, failed)) {
+    Outcome outcome = kAllPassed;
+    while (const Job* job = NextHashed(ahead, outcome)) {
       digests.Write(job->digest.data(), job->digest.size());
+    }
+    // Records of part of a manifest that could not be read are not put in
+    // place: the old digest file stays.
+    if (outcome == kUnreadable) {
+      return 1;
     }
   }
   // A digest file that cannot be put in place fails like one that cannot be
@@ -408,10 +457,12 @@ void VerifyManifestFile(const char* path) {
   }
   EntryRead read = EntryRead::kEnd;
   while ((read = ReadEntry(manifest.get(), entry)) == EntryRead::kEntry) {
+    // Every entry before the match skips its record, to stay in step.
+    Digest record{};
     if (std::strcmp(entry.data(), path) != 0) {
-      // Skip this entry's record to stay in step with the manifest.
-      Digest skipped{};
-      ReadRecord(digests.get(), skipped);
+      if (!ReadRecord(digests.get(), record)) {
+        break;
+      }
       continue;
     }
     Digest digest{};
@@ -419,20 +470,19 @@ void VerifyManifestFile(const char* path) {
       break;
     }
     PrintDigest("md_sha: ", digest);
-    Digest record{};
-    ReadRecord(digests.get(), record);
+    if (!ReadRecord(digests.get(), record)) {
+      break;
+    }
     PrintDigest("rd_sha: ", record);
     PrintOutcome(entry, SameDigest(digest, record));
     break;
   }
-  if (read == EntryRead::kTooLong) {
-    PrintTooLong(entry);
-  }
+  (void)PrintEntryFailure(read, entry);
   CloseBoth(digests, manifest);
 }
 
 int VerifyManifest(int verbose) {
-  int failed = 0;
+  Outcome outcome = kAllPassed;
   File digests;
   File manifest;
   if (!OpenBoth(digests, manifest)) {
@@ -443,12 +493,15 @@ int VerifyManifest(int verbose) {
     // Every worker has stopped at the end of this block, before the manifest
     // is closed. Failures to hash are reported whatever the verbose flag.
     HashAhead ahead(manifest.get());
-    while (const Job* job = NextHashed(ahead, failed)) {
+    while (const Job* job = NextHashed(ahead, outcome)) {
       if (verbose == 1) {
         PrintDigest("md_sha: ", job->digest);
       }
       Digest record{};
-      ReadRecord(digests.get(), record);
+      if (!ReadRecord(digests.get(), record)) {
+        outcome = kUnreadable;
+        break;
+      }
       if (verbose == 1) {
         PrintDigest("rd_sha: ", record);
       }
@@ -457,14 +510,14 @@ int VerifyManifest(int verbose) {
         PrintOutcome(job->entry, matches);
       }
       if (!matches) {
-        failed = 1;
+        outcome = kEntryFailed;
         break;
       }
     }
   }
   CloseBoth(digests, manifest);
   // The outcome travels only in the status line; the result says whether the
-  // files could be opened.
-  WriteBootStatus(failed != 0 ? kBootStatusBnFail : kBootStatusBnOk);
-  return 0;
+  // files could be opened and read.
+  WriteBootStatus(outcome != kAllPassed ? kBootStatusBnFail : kBootStatusBnOk);
+  return outcome == kUnreadable ? 1 : 0;
 }

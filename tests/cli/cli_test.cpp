@@ -39,6 +39,13 @@ std::function<void()> Put(const std::string& path, std::optional<std::string> by
   return [=] { bytes ? t::WriteFile(path, *bytes) : void(fs::remove(path)); };
 }
 
+// EioOn runs |program| with every read of |path| failing with EIO.
+std::vector<std::string> EioOn(const std::string& path, const std::string& program) {
+  return {"strace", "-qq", "-o",         "/dev/null", "-P",
+          path,     "-e",  "trace=read", "-e",        "inject=read:error=EIO",
+          program};
+}
+
 // Every run starts from a (empty), b, and c, a link to a file whose path has
 // 99 characters (the most an entry may hold), listed with mixed white space,
 // b twice; their records followed by bytes never read; a log left by an
@@ -86,6 +93,10 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
       {"a FIFO listed", {K}, aOpen, [] { fs::remove(a), mkfifo(a.c_str(), 0600); }},
       {"a file of 2 GiB", {K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
       {"a file of 4 GiB and a byte", {K}, aOpen, [] { fs::resize_file(a, (1ULL << 32) + 1); }},
+      {"an entry with a NUL byte", {K}, kOff + "file[" + a + "] open error!!\n" + fail,
+       Put(kManifest, a + std::string("\0x ", 3) + b)},
+      {"a manifest that cannot be read", EioOn(kManifest, K), kOff + kManifest + " open error!!!\n" + fail, [] {}, 1},
+      {"a digest file that cannot be read", EioOn(kDigests, K), kOff + kDigests + " open error!!!\n" + fail, [] {}, 1},
       // clang-format on
   };
   const auto setUp = [&] {
