@@ -9,6 +9,7 @@ packages=(
   libgtest-dev
   libtss2-dev libtss2-tcti-swtpm0 tpm2-tools swtpm swtpm-tools
   valgrind clang-format strace time
+  groff-base shellcheck systemd dpkg-dev file binutils
 )
 
 missing=()

@@ -1,0 +1,56 @@
+# The install tree and the Debian package: the programs, libkmm with kmm.h,
+# its pkg-config file and CMake package, the man pages, the boot unit and the
+# init script.
+include(GNUInstallDirs)
+include(CMakePackageConfigHelpers)
+
+install(TARGETS keymgr kmm-host keymgr-eeprom RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+install(TARGETS kmm kmm_shared EXPORT kmmTargets
+        ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
+        LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
+install(FILES include/kmm/kmm.h DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/kmm)
+
+set(_kmm_cmakedir ${CMAKE_INSTALL_LIBDIR}/cmake/kmm)
+install(EXPORT kmmTargets NAMESPACE kmm:: DESTINATION ${_kmm_cmakedir})
+configure_package_config_file(dist/kmmConfig.cmake.in ${PROJECT_BINARY_DIR}/dist/kmmConfig.cmake
+                              INSTALL_DESTINATION ${_kmm_cmakedir})
+write_basic_package_version_file(${PROJECT_BINARY_DIR}/dist/kmmConfigVersion.cmake
+                                 COMPATIBILITY SameMajorVersion)
+install(FILES ${PROJECT_BINARY_DIR}/dist/kmmConfig.cmake
+              ${PROJECT_BINARY_DIR}/dist/kmmConfigVersion.cmake
+        DESTINATION ${_kmm_cmakedir})
+
+# The .pc file finds its prefix from where it lies, so that the tree can be
+# installed under any prefix.
+file(RELATIVE_PATH KMM_PC_PREFIX ${CMAKE_INSTALL_FULL_LIBDIR}/pkgconfig ${CMAKE_INSTALL_PREFIX})
+string(REGEX REPLACE "/$" "" KMM_PC_PREFIX "${KMM_PC_PREFIX}")
+configure_file(dist/kmm.pc.in ${PROJECT_BINARY_DIR}/dist/kmm.pc @ONLY)
+install(FILES ${PROJECT_BINARY_DIR}/dist/kmm.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)
+
+install(FILES dist/man/keymgr.8 dist/man/kmm-host.8 dist/man/keymgr-eeprom.8
+        DESTINATION ${CMAKE_INSTALL_MANDIR}/man8)
+install(FILES dist/man/libkmm.3 DESTINATION ${CMAKE_INSTALL_MANDIR}/man3)
+
+# Boot integration. The unit and the script name the programs where this
+# build installs them. A package build points KEYMGR_INITDIR at /etc/init.d.
+set(KEYMGR_UNITDIR "lib/systemd/system" CACHE STRING "Where the systemd unit is installed")
+set(KEYMGR_INITDIR "etc/init.d" CACHE STRING "Where the init script is installed")
+configure_file(dist/keymgr-boot.service.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service @ONLY)
+configure_file(dist/keymgr-boot.init.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot @ONLY)
+install(FILES ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service DESTINATION ${KEYMGR_UNITDIR})
+install(PROGRAMS ${PROJECT_BINARY_DIR}/dist/keymgr-boot DESTINATION ${KEYMGR_INITDIR})
+
+# cpack -G DEB: one package, its Depends found by dpkg-shlibdeps.
+set(CPACK_PACKAGE_NAME keymgr)
+set(CPACK_PACKAGE_VERSION ${PROJECT_VERSION})
+set(CPACK_PACKAGE_CONTACT "keymgr developers <keymgr@localhost>")
+set(CPACK_PACKAGE_DESCRIPTION_SUMMARY
+    "boot-time file integrity check and TPM-backed key management")
+set(CPACK_DEBIAN_PACKAGE_SECTION admin)
+set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
+set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
+set(CPACK_SET_DESTDIR ON)
+if(KEYMGR_DEB_ARCHITECTURE)
+  set(CPACK_DEBIAN_PACKAGE_ARCHITECTURE ${KEYMGR_DEB_ARCHITECTURE})
+endif()
+include(CPack)
