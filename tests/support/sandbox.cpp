@@ -6,6 +6,7 @@
 
 #include <csignal>
 
+#include <algorithm>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -73,12 +74,25 @@ void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& byt
   WriteFile(KEYMGR_EEPROM_PATH, image.replace(offset, bytes.size(), {bytes.begin(), bytes.end()}));
 }
 
+// Emulated puts the emulator of a cross build in front of the first argument
+// that is a program of this build, also behind a launcher such as strace.
+std::vector<std::string> Emulated(std::vector<std::string> argv) {
+  static const std::vector<std::string> emulator{KEYMGR_TEST_EMULATOR};
+  const auto built = std::find_if(argv.begin(), argv.end(), [](const std::string& arg) {
+    return arg.starts_with(KEYMGR_TEST_BINARY_DIR "/");
+  });
+  if (built != argv.end()) {
+    argv.insert(built, emulator.begin(), emulator.end());
+  }
+  return argv;
+}
+
 // Run goes through the shell for its redirections, which then execs argv[0]
 // itself, so a signal still shows as -1.
 RunResult Run(const std::vector<std::string>& argv) {
   const std::string out = "/tmp/keymgr-run-" + std::to_string(getpid()), err = out + ".err";
   std::string command = "exec";
-  for (const auto& arg : argv) {
+  for (const auto& arg : Emulated(argv)) {
     command += " '" + std::regex_replace(arg, std::regex("'"), "'\\''") + "'";
   }
   const int wstatus = std::system((command + " </dev/null >" + out + " 2>" + err).c_str());
@@ -111,9 +125,10 @@ bool Ended(pid_t pid) {
 // together with seccomp-bpf.)
 bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>& argv) {
   const std::string log = "/tmp/keymgr-kill-" + std::to_string(getpid());
-  const auto args = StraceArgs({"-o", log, "-e", "trace=" + call, "-e",
-                                "inject=" + call + ":delay_enter=60s:when=" + std::to_string(n)},
-                               argv);
+  const auto args =
+      Emulated(StraceArgs({"-o", log, "-e", "trace=" + call, "-e",
+                           "inject=" + call + ":delay_enter=60s:when=" + std::to_string(n)},
+                          argv));
   fs::remove(log);
   const pid_t strace = fork();
   if (strace == 0) {
