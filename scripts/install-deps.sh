@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Installs what keymgr needs to build and test on Debian 12, only when some
-# of it is missing.
+# of it is missing. Further packages named as arguments (a cross compiler,
+# say) are installed with them.
 set -euo pipefail
 
 packages=(
@@ -10,6 +11,7 @@ packages=(
   libtss2-dev libtss2-tcti-swtpm0 tpm2-tools swtpm swtpm-tools
   valgrind clang-format strace time
   groff-base shellcheck systemd dpkg-dev file binutils
+  "$@"
 )
 
 missing=()
