@@ -31,15 +31,16 @@ register_binfmt() {
   if [ ! -e "$dir/qemu-$cpu" ] && [ -e "$dir/register" ]; then
     $sudo tee "$dir/register" </usr/lib/binfmt.d/"qemu-$cpu.conf" >/dev/null 2>&1 || true
   fi
-  if [ -e "$dir/qemu-$cpu" ]; then
+  if grep -qx enabled "$dir/qemu-$cpu" 2>/dev/null; then
     echo "binfmt_misc starts $cpu programs; run one by hand as" \
-      "QEMU_LD_PREFIX=$build/sysroot $build/keymgr -v"
+      "QEMU_LD_PREFIX=$build/sysroot PROGRAM"
   else
-    echo "note: binfmt_misc cannot be set up here (not mounted, or no privilege to" \
-      "register, as in an unprivileged container); the tests do not need it. To start" \
-      "$cpu programs directly, register qemu-user-static on the host as root" \
+    echo "note: binfmt_misc does not start $cpu programs here (it cannot be mounted, or" \
+      "qemu registered, without privilege, as in an unprivileged container; or the entry" \
+      "is disabled); the tests do not need it. To start $cpu programs directly, register" \
+      "qemu-user-static on the host as root" \
       "(systemctl restart systemd-binfmt, or update-binfmts --enable qemu-$cpu with" \
-      "binfmt-support), or run one as qemu-$cpu-static -L $build/sysroot $build/keymgr -v"
+      "binfmt-support), or run one as qemu-$cpu-static -L $build/sysroot PROGRAM"
   fi
 }
 
