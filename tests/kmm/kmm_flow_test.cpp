@@ -249,8 +249,10 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
 // something when it fails on one seeded by the host call: from the TPM and
 // the kernel, or the kernel alone.
 TEST(KmmFlow, SeedKeyIsUnguessableOnlyAfterTheHostSeedsTheGenerator) {
-  for (unsigned int weak : {1u, static_cast<unsigned int>(std::time(nullptr)), 4321u}) {
+  // Unseeded (as srandom(1)), seeded from the clock, from a process id.
+  for (int way = 0; way < 3; ++way) {
     Reset();
+    const unsigned int weak = way == 0 ? 1 : way == 1 ? std::time(nullptr) : 4321;
     srandom(weak);
     ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
     EXPECT_NE(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "") << weak;
