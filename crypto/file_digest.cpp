@@ -1,8 +1,6 @@
 #include "crypto/file_digest.h"
 
-#include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <cstdint>
@@ -18,30 +16,6 @@
 namespace keymgr {
 
 namespace {
-
-// OpenRegular opens |path| without blocking and only when it is a regular
-// file: a FIFO with no writer would otherwise block the boot run for ever,
-// and devices or directories have no meaningful contents to hash.
-File OpenRegular(const char* path, const char* mode) {
-  int fd = ::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
-  if (fd < 0) {
-    return File();
-  }
-  struct stat st {};
-  if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
-    int saved = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
-    ::close(fd);
-    errno = saved;
-    return File();
-  }
-  std::FILE* f = ::fdopen(fd, mode);
-  if (f == nullptr) {
-    int saved = errno;
-    ::close(fd);
-    errno = saved;
-  }
-  return File(f);
-}
 
 void FreeMemory(void* memory) {
   std::free(memory);
@@ -62,7 +36,7 @@ Status ComputeFileDigest(const char* path, const char* mode,
   }
   const auto size = static_cast<std::int32_t>(st.st_size);
 
-  File file = OpenRegular(path, mode);
+  File file = OpenFile(path, mode);
   if (!file) {
     return ErrnoFailure("open");
   }
