@@ -24,7 +24,7 @@ namespace eeprom = keymgr::eeprom;
 // Finish flushes what was printed so the boot script's capture is complete
 // before the status is seen.
 int Finish(int status) {
-  std::fflush(stdout);
+  (void)std::fflush(stdout);
   return status;
 }
 

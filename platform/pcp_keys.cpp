@@ -406,11 +406,11 @@ int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
 }
 
 int pcp_create_key(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint32_t bits,
-                   uint32_t) {
+                   uint32_t /*flags*/) {
   return Result(CreateKey(nameDigest, passwordDigest, bits));
 }
 
-int pcp_delete_key(const uint8_t* nameDigest, uint32_t) {
+int pcp_delete_key(const uint8_t* nameDigest, uint32_t /*flags*/) {
   return Result(DeleteKey(nameDigest));
 }
 
@@ -418,8 +418,8 @@ int pcp_evict_stale_keys(const uint8_t* keepNameDigest) {
   return Result(EvictStaleKeys(keepNameDigest));
 }
 
-int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
-                            uint8_t* out, uint32_t* outSize) {
+int pcp_encryptDataFragment(const char* nameHex, const char* /*passHex*/, const uint8_t* data,
+                            uint32_t length, uint8_t* out, uint32_t* outSize) {
   return Result(Seal(nameHex, data, length, out, outSize));
 }
 

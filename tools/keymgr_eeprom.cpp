@@ -26,14 +26,14 @@ constexpr std::size_t kImageSize = keymgr::eeprom::kSize;
 constexpr int kErrorStatus = 1;
 
 int Fail(const char* what) {
-  std::fprintf(stderr, "keymgr-eeprom: %s\n", what);
+  (void)std::fprintf(stderr, "keymgr-eeprom: %s\n", what);
   return kErrorStatus;
 }
 
 int Usage() {
-  std::fprintf(stderr,
-               "usage: keymgr-eeprom init | read OFFSET LENGTH | write OFFSET HEX\n"
-               "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal\n");
+  (void)std::fprintf(stderr,
+                     "usage: keymgr-eeprom init | read OFFSET LENGTH | write OFFSET HEX\n"
+                     "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal\n");
   return kErrorStatus;
 }
 

@@ -13,7 +13,7 @@ namespace {
 constexpr int kUsageStatus = 2;
 
 int Usage() {
-  std::fprintf(stderr, "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup\n");
+  (void)std::fprintf(stderr, "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup\n");
   return kUsageStatus;
 }
 
@@ -24,7 +24,7 @@ int main(int argc, char** argv) {
   const keymgr::tools::HostArgs args = keymgr::tools::ParseHostArgs(argc, argv);
   if (args.action == Action::kDmsetup) {
     int result = CheckDmsetupDigest();
-    std::fflush(stdout);
+    (void)std::fflush(stdout);
     return result == 0 ? 0 : 1;
   }
   if (args.action == Action::kUsage) {
@@ -33,10 +33,10 @@ int main(int argc, char** argv) {
   // A regeneration's seed key comes from random(); without fresh seeding
   // the secret key could be guessed, so that run does not go ahead.
   if (KmmSeedRandom() < 0 && args.option == KMM_OPTION_REGENERATE) {
-    std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
+    (void)std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
     return 1;
   }
   KeyContext* context = KeyManage(args.option, args.logFlag);
-  std::fflush(stdout);
+  (void)std::fflush(stdout);
   return context != nullptr ? 0 : 1;
 }

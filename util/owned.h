@@ -49,7 +49,7 @@ class Owned {
 };
 
 inline void CloseStream(std::FILE* f) {
-  std::fclose(f);
+  (void)std::fclose(f);
 }
 inline void CloseDescriptor(int fd) {
   ::close(fd);
