@@ -9,7 +9,7 @@ packages=(
   libgtest-dev
   libtss2-dev libtss2-tcti-swtpm0 tpm2-tools swtpm swtpm-tools
   valgrind clang-format strace
-  clang libclang-rt-14-dev clang-tidy cppcheck
+  clang libclang-rt-14-dev clang-tidy cppcheck devscripts
 )
 
 missing=()
