@@ -115,6 +115,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     return in.ConsumeBool() ? valid : in.ConsumeIntegral<std::uint32_t>();
   };
   std::vector<Job> jobs;
+  // job picks one of the live containers, or none when there is none.
+  const auto job = [&]() -> Job* {
+    return jobs.empty() ? nullptr
+                        : &jobs[in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1)];
+  };
+  const auto length = [&] { return in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize); };
 
   for (int step = 0; step < 64 && in.remaining_bytes() > 0; ++step) {
     const Bytes before = Arrays();
@@ -123,8 +129,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
       case 0: {
         const auto index = in.ConsumeIntegralInRange<std::uint32_t>(0, 4);
         ProtectedKey* ref = nullptr;
-        std::uint32_t length = 0;
-        code = VKT_DTC_GetConstant(index, &ref, &length);
+        std::uint32_t refLength = 0;
+        code = VKT_DTC_GetConstant(index, &ref, &refLength);
         Check((code == 0) == (index >= 1 && index <= 3) && (ref != nullptr) == (code == 0));
         break;
       }
@@ -137,13 +143,13 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
       }
       case 2: {
         ProtectedKey* key = record();
-        const std::uint32_t length = in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize);
-        if (length > Capacity(key)) {
+        const std::uint32_t count = length();
+        if (count > Capacity(key)) {
           continue;
         }
-        const Bytes plain = Plain(key, length);
-        code = ProtectedKey_SetLength(key, length);
-        Check(code != 0 || Plain(key, length) == plain);
+        const Bytes plain = Plain(key, count);
+        code = ProtectedKey_SetLength(key, count);
+        Check(code != 0 || Plain(key, count) == plain);
         break;
       }
       case 3:
@@ -161,64 +167,58 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         }
         continue;
       case 5: {
-        if (jobs.empty()) {
-          continue;
-        }
-        Job& job = jobs[in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1)];
+        Job* hash = job();
         const ProtectedKey* input = record();
         ProtectedKey* output = record();
-        const std::uint32_t length = in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize);
+        const std::uint32_t count = length();
         std::uint32_t produced = in.ConsumeIntegralInRange<std::uint32_t>(0, 40);
-        if (length > Capacity(input) || Capacity(output) < 32) {
+        if (hash == nullptr || count > Capacity(input) || Capacity(output) < 32) {
           continue;
         }
-        const Bytes expected = Sha256(Plain(input, length));
-        code = VKT_DTC_GetHash(job.container, selector(DTC_HASH_SELECTOR), input, length, output,
+        const Bytes expected = Sha256(Plain(input, count));
+        code = VKT_DTC_GetHash(hash->container, selector(DTC_HASH_SELECTOR), input, count, output,
                                &produced);
         Check(code != 0 || (produced == 32 && Plain(output, 32) == expected));
         break;
       }
       case 6: {
-        if (jobs.empty()) {
+        Job* aes = job();
+        if (aes == nullptr) {
           continue;
         }
-        Job& job = jobs[in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1)];
         const std::uint32_t direction =
             selector(in.ConsumeBool() ? DTC_AES_ENCRYPT : DTC_AES_DECRYPT);
         const ProtectedKey* key = record();
         const ProtectedKey* param = record();
-        code = VKT_DTC_AES_Init(job.container, direction, selector(DTC_AES_MODE), key,
+        code = VKT_DTC_AES_Init(aes->container, direction, selector(DTC_AES_MODE), key,
                                 in.ConsumeBool() ? 32 : in.ConsumeIntegral<std::uint32_t>(), param);
         if (code == 0) {
-          job = {job.container, true, direction == DTC_AES_ENCRYPT, Plain(key, 32),
-                 Plain(param, 16)};
+          *aes = {aes->container, true, direction == DTC_AES_ENCRYPT, Plain(key, 32),
+                  Plain(param, 16)};
         }
         break;
       }
       case 7: {
-        if (jobs.empty()) {
-          continue;
-        }
-        Job& job = jobs[in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1)];
+        Job* aes = job();
         const ProtectedKey* input = record();
         ProtectedKey* output = record();
-        const std::uint32_t length = in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize);
+        const std::uint32_t count = length();
         std::uint32_t produced = 0;
-        if (length > Capacity(input) || length > Capacity(output)) {
+        if (aes == nullptr || count > Capacity(input) || count > Capacity(output)) {
           continue;
         }
-        const Bytes plain = Plain(input, length);
-        code = VKT_DTC_AES_Process(job.container, input, length, output, &produced);
-        Check(code != 0 || (job.aesReady && produced == length &&
-                            Plain(output, length) == Aes(job.encrypt, job.key, job.iv, plain)));
-        job.aesReady = job.aesReady && code != 0;
+        const Bytes plain = Plain(input, count);
+        code = VKT_DTC_AES_Process(aes->container, input, count, output, &produced);
+        Check(code != 0 || (aes->aesReady && produced == count &&
+                            Plain(output, count) == Aes(aes->encrypt, aes->key, aes->iv, plain)));
+        aes->aesReady = aes->aesReady && code != 0;
         break;
       }
     }
     Check(code == 0 || Arrays() == before);
   }
-  for (const Job& job : jobs) {
-    Check(VKT_DTC_DestroyCryptoContainer(job.container) == 0);
+  for (const Job& live : jobs) {
+    Check(VKT_DTC_DestroyCryptoContainer(live.container) == 0);
   }
   return 0;
 }
