@@ -6,9 +6,9 @@
 // Command words match as prefixes, so "hashes" is "hash" and "-version" is "-v".
 #include <cstdint>
 #include <cstdio>
-#include <cstring>
 
 #include "bootlog/boot_status.h"
+#include "cli/command.h"
 #include "integrity/manifest.h"
 #include "platform/eeprom.h"
 #include "platform/eeprom_map.h"
@@ -24,7 +24,7 @@ namespace eeprom = keymgr::eeprom;
 // Finish flushes what was printed so the boot script's capture is complete
 // before the status is seen.
 int Finish(int status) {
-  std::fflush(stdout);
+  (void)std::fflush(stdout);
   return status;
 }
 
@@ -41,22 +41,20 @@ bool ControlByteEnablesVerification() {
 }  // namespace
 
 int main(int argc, char** argv) {
-  int verbose = 0;
-  if (argc > 1) {
-    const char* word = argv[1];
-    if (std::strncmp("hash", word, 4) == 0) {
+  using keymgr::cli::Action;
+  const keymgr::cli::Command command = keymgr::cli::ParseCommand(argc, argv);
+  switch (command.action) {
+    case Action::kHash:
       (void)HashManifest();
       return Finish(0);
-    }
-    if (std::strncmp("log", word, 3) == 0) {
-      verbose = 1;
-    } else if (std::strncmp("file", word, 4) == 0) {
-      VerifyManifestFile(argc > 2 ? argv[2] : nullptr);
+    case Action::kFile:
+      VerifyManifestFile(command.path);
       return Finish(0);
-    } else if (std::strncmp("-v", word, 2) == 0) {
+    case Action::kVersion:
       DebugPrint("Version: %d.%d\n", kVersionMajor, kVersionMinor);
       return Finish(0);
-    }
+    case Action::kVerify:
+      break;
   }
 
   int enabled = ControlByteEnablesVerification() ? 1 : 0;
@@ -67,5 +65,5 @@ int main(int argc, char** argv) {
   if (enabled != 1) {
     return Finish(0);
   }
-  return Finish(VerifyManifest(verbose));
+  return Finish(VerifyManifest(command.verbose));
 }

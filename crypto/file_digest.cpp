@@ -2,10 +2,10 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <limits>
@@ -68,30 +68,22 @@ Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   // Opened without blocking: a FIFO with no writer would otherwise hold the
   // boot run for ever. Opening first and asking the descriptor for the size
   // walks the path once; only a path that cannot be opened is stat'ed, since
-  // a failed stat, not the open, is what makes a status failure.
-  file.fd.reset(::open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  // a failed stat, not the open, is what makes a status failure. Devices and
+  // directories have no meaningful contents to hash.
+  std::uint64_t size = 0;
+  file.fd = OpenRegular(path, O_RDONLY, &size);
   if (!file.fd) {
     const int error = errno;
     struct stat st;
     return ::stat(path, &st) < 0 ? ErrnoFailure("stat") : ErrnoFailure("open", error);
   }
   // The size is a signed 32-bit count: a file of 2 GiB or more fails like an
-  // unopenable one rather than wrapping. Devices and directories have no
-  // meaningful contents to hash.
-  struct stat st {};
-  int error = 0;
-  if (::fstat(file.fd.get(), &st) != 0) {
-    error = errno;
-  } else if (!S_ISREG(st.st_mode)) {
-    error = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
-  } else if (st.st_size < 0 || st.st_size > std::numeric_limits<std::int32_t>::max()) {
-    error = EFBIG;
-  }
-  if (error != 0) {
+  // unopenable one rather than wrapping.
+  if (size > static_cast<std::uint64_t>(std::numeric_limits<std::int32_t>::max())) {
     file.fd.reset();
-    return ErrnoFailure("open", error);
+    return ErrnoFailure("open", EFBIG);
   }
-  file.size = static_cast<std::size_t>(st.st_size);
+  file.size = static_cast<std::size_t>(size);
   if (soon && file.size > 0) {
     // Advice only: its result changes nothing.
     (void)::posix_fadvise(file.fd.get(), 0, static_cast<off_t>(std::min(file.size, kSoonBytes)),

@@ -31,13 +31,15 @@ constexpr std::array<std::uint8_t, kIvSize> kAesIv = {
 
 // The expected digest of the disk-mapper tool (constant 3), taken from the
 // build option at compile time; configure has already checked its form.
+constexpr std::size_t kDigestDigits = std::size_t{2} * kDigestSize;
+
 constexpr bool IsDigestText(const char* text) {
-  for (std::size_t i = 0; i < 2 * kDigestSize; ++i) {
+  for (std::size_t i = 0; i < kDigestDigits; ++i) {
     if (HexDigitValue(text[i]) < 0) {
       return false;
     }
   }
-  return text[2 * kDigestSize] == '\0';
+  return text[kDigestDigits] == '\0';
 }
 
 constexpr std::array<std::uint8_t, kDigestSize> ParseDigest(const char* text) {
@@ -49,7 +51,7 @@ constexpr std::array<std::uint8_t, kDigestSize> ParseDigest(const char* text) {
   return out;
 }
 
-static_assert(sizeof(KEYMGR_DMSETUP_SHA256) == 2 * kDigestSize + 1 &&
+static_assert(sizeof(KEYMGR_DMSETUP_SHA256) == kDigestDigits + 1 &&
                   IsDigestText(KEYMGR_DMSETUP_SHA256),
               "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
 constexpr std::array<std::uint8_t, kDigestSize> kDmsetupDigest = ParseDigest(KEYMGR_DMSETUP_SHA256);

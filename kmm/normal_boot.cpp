@@ -23,12 +23,14 @@ constexpr int kStoreKeyAttempts = 3;
 // included. A clock that cannot be converted gives a placeholder line, so
 // the banner keeps its shape.
 struct LocalTimeText {
+  static constexpr char kUnavailable[] = "(local time unavailable)\n";
   std::array<char, 64> text{};
   LocalTimeText() {
+    static_assert(sizeof(kUnavailable) <= sizeof(text));
     std::time_t now = std::time(nullptr);
     std::tm local{};
     if (localtime_r(&now, &local) == nullptr || asctime_r(&local, text.data()) == nullptr) {
-      std::strcpy(text.data(), "(local time unavailable)\n");
+      std::memcpy(text.data(), kUnavailable, sizeof(kUnavailable));
     }
   }
 };

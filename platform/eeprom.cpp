@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <openssl/crypto.h>
 #include <sys/file.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -33,19 +32,8 @@ struct Image {
 // OpenImage opens the image without blocking on a special file and accepts
 // only a regular file.
 Status OpenImage(int flags, Image& image) {
-  image.fd.reset(::open(keymgr::kEepromPath, flags | O_NONBLOCK | O_CLOEXEC));
-  if (!image.fd) {
-    return ErrnoFailure("open");
-  }
-  struct stat st {};
-  if (::fstat(image.fd.get(), &st) != 0) {
-    return ErrnoFailure("fstat");
-  }
-  if (!S_ISREG(st.st_mode) || st.st_size < 0) {
-    return ErrnoFailure("open", ENODEV);
-  }
-  image.size = static_cast<std::uint64_t>(st.st_size);
-  return Status();
+  image.fd = keymgr::OpenRegular(keymgr::kEepromPath, flags, &image.size);
+  return image.fd ? Status() : ErrnoFailure("open");
 }
 
 // CheckRequest rejects another device, a missing buffer and a length that

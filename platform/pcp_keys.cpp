@@ -451,11 +451,11 @@ int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn) {
 }
 
 int pcp_create_key(const uint8_t* nameDigest, const uint8_t* passwordDigest, uint32_t bits,
-                   uint32_t) {
+                   uint32_t /*flags*/) {
   return OnTpm([&](Connection& tpm) { return CreateKey(tpm, nameDigest, passwordDigest, bits); });
 }
 
-int pcp_delete_key(const uint8_t* nameDigest, uint32_t) {
+int pcp_delete_key(const uint8_t* nameDigest, uint32_t /*flags*/) {
   return OnTpm([&](Connection& tpm) { return DeleteKey(tpm, nameDigest); });
 }
 
@@ -463,8 +463,8 @@ int pcp_evict_stale_keys(const uint8_t* keepNameDigest) {
   return OnTpm([&](Connection& tpm) { return EvictStaleKeys(tpm, keepNameDigest); });
 }
 
-int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
-                            uint8_t* out, uint32_t* outSize) {
+int pcp_encryptDataFragment(const char* nameHex, const char* /*passHex*/, const uint8_t* data,
+                            uint32_t length, uint8_t* out, uint32_t* outSize) {
   return OnTpm([&](Connection& tpm) { return Seal(tpm, nameHex, data, length, out, outSize); });
 }
 

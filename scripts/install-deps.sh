@@ -11,6 +11,7 @@ packages=(
   libtss2-dev libtss2-tcti-swtpm0 tpm2-tools swtpm swtpm-tools
   valgrind clang-format strace time
   groff-base shellcheck systemd dpkg-dev file binutils
+  clang libclang-rt-14-dev clang-tidy cppcheck devscripts
   "$@"
 )
 

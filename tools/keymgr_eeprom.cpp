@@ -16,7 +16,7 @@
 
 #include "platform/eeprom.h"
 #include "platform/eeprom_map.h"
-#include "util/bytes.h"
+#include "tools/eeprom_args.h"
 #include "util/paths.h"
 #include "util/secure.h"
 
@@ -26,37 +26,15 @@ constexpr std::size_t kImageSize = keymgr::eeprom::kSize;
 constexpr int kErrorStatus = 1;
 
 int Fail(const char* what) {
-  std::fprintf(stderr, "keymgr-eeprom: %s\n", what);
+  (void)std::fprintf(stderr, "keymgr-eeprom: %s\n", what);
   return kErrorStatus;
 }
 
 int Usage() {
-  std::fprintf(stderr,
-               "usage: keymgr-eeprom init | read OFFSET LENGTH | write OFFSET HEX\n"
-               "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal\n");
+  (void)std::fprintf(stderr,
+                     "usage: keymgr-eeprom init | read OFFSET LENGTH | write OFFSET HEX\n"
+                     "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal\n");
   return kErrorStatus;
-}
-
-// ParseNumber accepts a whole unsigned 32-bit number, decimal or with a 0x
-// prefix, and nothing else (no sign, no blanks, no trailing text).
-bool ParseNumber(const char* text, std::uint32_t* value) {
-  int base = 10;
-  if (text[0] == '0' && (text[1] == 'x' || text[1] == 'X')) {
-    base = 16;
-    text += 2;
-  }
-  const char* digits = base == 16 ? "0123456789abcdefABCDEF" : "0123456789";
-  if (*text == '\0' || std::strspn(text, digits) != std::strlen(text)) {
-    return false;
-  }
-  errno = 0;
-  char* end = nullptr;
-  unsigned long long parsed = std::strtoull(text, &end, base);
-  if (errno != 0 || *end != '\0' || parsed > UINT32_MAX) {
-    return false;
-  }
-  *value = static_cast<std::uint32_t>(parsed);
-  return true;
 }
 
 // MakeParents creates every missing directory above |path|.
@@ -104,48 +82,28 @@ int Init() {
   return 0;
 }
 
-int Read(const char* offsetText, const char* lengthText) {
-  std::uint32_t offset = 0;
-  std::uint32_t length = 0;
-  if (!ParseNumber(offsetText, &offset) || !ParseNumber(lengthText, &length)) {
-    return Usage();
-  }
+int Read(std::uint32_t offset, std::size_t length) {
   // The image bounds any valid request, so a larger one fails without
   // allocating for it.
   if (length > kImageSize) {
     return Fail("read failed: the range lies outside the EEPROM image");
   }
   static std::uint8_t bytes[kImageSize];
-  if (ReadEEPROM(0, offset, length, bytes) < 0) {
+  if (ReadEEPROM(0, offset, static_cast<std::uint32_t>(length), bytes) < 0) {
     return Fail("read failed: no EEPROM image, or the range lies outside it");
   }
-  for (std::uint32_t i = 0; i < length; ++i) {
+  for (std::size_t i = 0; i < length; ++i) {
     std::printf(i == 0 ? "%02X" : " %02X", bytes[i]);
   }
   std::printf("\n");
   return std::fflush(stdout) == 0 ? 0 : kErrorStatus;
 }
 
-int Write(const char* offsetText, const char* hex) {
-  std::uint32_t offset = 0;
-  const std::size_t digits = std::strlen(hex);
-  if (!ParseNumber(offsetText, &offset) || digits == 0 || digits % 2 != 0) {
-    return Usage();
-  }
-  if (digits / 2 > kImageSize) {
+int Write(std::uint32_t offset, const std::uint8_t* bytes, std::size_t length) {
+  if (length > kImageSize) {
     return Fail("write failed: the range lies outside the EEPROM image");
   }
-  static std::uint8_t bytes[kImageSize];
-  const auto length = static_cast<std::uint32_t>(digits / 2);
-  for (std::uint32_t i = 0; i < length; ++i) {
-    int high = HexDigitValue(hex[2 * i]);
-    int low = HexDigitValue(hex[2 * i + 1]);
-    if (high < 0 || low < 0) {
-      return Usage();
-    }
-    bytes[i] = static_cast<std::uint8_t>(high << 4 | low);
-  }
-  if (WriteEEPROM_Bytes_Sema(0, offset, length, bytes) < 0) {
+  if (WriteEEPROM_Bytes_Sema(0, offset, static_cast<std::uint32_t>(length), bytes) < 0) {
     return Fail("write failed: no EEPROM image, or the range lies outside it");
   }
   return 0;
@@ -154,14 +112,18 @@ int Write(const char* offsetText, const char* hex) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc == 2 && std::strcmp(argv[1], "init") == 0) {
-    return Init();
-  }
-  if (argc == 4 && std::strcmp(argv[1], "read") == 0) {
-    return Read(argv[2], argv[3]);
-  }
-  if (argc == 4 && std::strcmp(argv[1], "write") == 0) {
-    return Write(argv[2], argv[3]);
+  using Action = keymgr::tools::EepromArgs::Action;
+  static std::uint8_t bytes[kImageSize];
+  const keymgr::tools::EepromArgs args = keymgr::tools::ParseEepromArgs(argc, argv, bytes);
+  switch (args.action) {
+    case Action::kInit:
+      return Init();
+    case Action::kRead:
+      return Read(args.offset, args.length);
+    case Action::kWrite:
+      return Write(args.offset, bytes, args.length);
+    case Action::kUsage:
+      break;
   }
   return Usage();
 }

@@ -5,60 +5,43 @@
 //   kmm-host srk                 KmmPersistSrk; exit 0 when the SRK is persistent
 #include <kmm/kmm.h>
 
-#include <cerrno>
-#include <climits>
 #include <cstdio>
-#include <cstdlib>
-#include <cstring>
+
+#include "tools/host_args.h"
 
 namespace {
 
 constexpr int kUsageStatus = 2;
 
 int Usage() {
-  std::fprintf(stderr, "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup | kmm-host srk\n");
+  (void)std::fprintf(stderr,
+                     "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup | kmm-host srk\n");
   return kUsageStatus;
-}
-
-// ParseInt accepts a whole decimal int, sign allowed, and nothing else.
-bool ParseInt(const char* text, int* value) {
-  if (text == nullptr || *text == '\0') {
-    return false;
-  }
-  char* end = nullptr;
-  errno = 0;
-  long parsed = std::strtol(text, &end, 10);
-  if (errno != 0 || *end != '\0' || parsed < INT_MIN || parsed > INT_MAX) {
-    return false;
-  }
-  *value = static_cast<int>(parsed);
-  return true;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc == 2 && std::strcmp(argv[1], "dmsetup") == 0) {
+  using Action = keymgr::tools::HostArgs::Action;
+  const keymgr::tools::HostArgs args = keymgr::tools::ParseHostArgs(argc, argv);
+  if (args.action == Action::kDmsetup) {
     int result = CheckDmsetupDigest();
-    std::fflush(stdout);
+    (void)std::fflush(stdout);
     return result == 0 ? 0 : 1;
   }
-  if (argc == 2 && std::strcmp(argv[1], "srk") == 0) {
+  if (args.action == Action::kSrk) {
     return KmmPersistSrk() == 0 ? 0 : 1;
   }
-  int option = 0;
-  int logFlag = 0;
-  if (argc < 2 || argc > 3 || !ParseInt(argv[1], &option) ||
-      (argc == 3 && !ParseInt(argv[2], &logFlag))) {
+  if (args.action == Action::kUsage) {
     return Usage();
   }
   // A regeneration's seed key comes from random(); without fresh seeding
   // the secret key could be guessed, so that run does not go ahead.
-  if (KmmSeedRandom() < 0 && option == KMM_OPTION_REGENERATE) {
-    std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
+  if (KmmSeedRandom() < 0 && args.option == KMM_OPTION_REGENERATE) {
+    (void)std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
     return 1;
   }
-  KeyContext* context = KeyManage(option, logFlag);
-  std::fflush(stdout);
+  KeyContext* context = KeyManage(args.option, args.logFlag);
+  (void)std::fflush(stdout);
   return context != nullptr ? 0 : 1;
 }

@@ -59,10 +59,11 @@ Status AtomicFile::Open(const char* path, mode_t mode) {
   anonymous_ = static_cast<bool>(fd_);
   if (!fd_ && NoAnonymousFiles(errno)) {
     std::array<char, kNameSize> templ{};
-    std::snprintf(templ.data(), templ.size(), "%s/.%s.XXXXXX", dir.data(), base_);
+    (void)std::snprintf(templ.data(), templ.size(), "%s/.%s.XXXXXX", dir.data(), base_);
     fd_.reset(::mkostemp(templ.data(), O_CLOEXEC));
     if (fd_) {
-      std::snprintf(tempPath_.data(), tempPath_.size(), "%s", std::strrchr(templ.data(), '/') + 1);
+      (void)std::snprintf(tempPath_.data(), tempPath_.size(), "%s",
+                          std::strrchr(templ.data(), '/') + 1);
     }
   }
   // The umask must not widen or narrow the mode of a key file.
@@ -103,7 +104,7 @@ Status AtomicFile::Flush() {
 // Link gives the unnamed file a temporary name beside |path|. A stale name
 // from an earlier crash between link and rename is replaced.
 Status AtomicFile::Link() {
-  std::snprintf(tempPath_.data(), tempPath_.size(), ".%s.new", base_);
+  (void)std::snprintf(tempPath_.data(), tempPath_.size(), ".%s.new", base_);
   if (::unlinkat(dirFd_.get(), tempPath_.data(), 0) != 0 && errno != ENOENT) {
     tempPath_[0] = '\0';
     return ErrnoFailure("unlinkat");
@@ -113,7 +114,7 @@ Status AtomicFile::Link() {
   }
   // Without CAP_DAC_READ_SEARCH the descriptor is linked through /proc.
   char self[32];
-  std::snprintf(self, sizeof(self), "/proc/self/fd/%d", fd_.get());
+  (void)std::snprintf(self, sizeof(self), "/proc/self/fd/%d", fd_.get());
   if (::linkat(AT_FDCWD, self, dirFd_.get(), tempPath_.data(), AT_SYMLINK_FOLLOW) == 0) {
     return Status();
   }

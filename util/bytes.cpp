@@ -1,5 +1,6 @@
 #include "util/bytes.h"
 
+#include <cstddef>
 #include <cstring>
 
 #include "util/debug_print.h"
@@ -54,10 +55,10 @@ int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uin
     DebugPrint("ERR: to short destination buffer");
     return -1;
   }
-  for (int i = 0; i < length; ++i) {
+  for (std::size_t i = 0; i < length; ++i) {
     dst[2 * i] = kDigits[src[i] >> 4];
     dst[2 * i + 1] = kDigits[src[i] & 0x0F];
   }
-  dst[2 * length] = '\0';
+  dst[std::size_t{2} * length] = '\0';
   return 0;
 }

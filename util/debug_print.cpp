@@ -22,6 +22,6 @@ void DiagnosticPrint(const char* format, ...) {
   }
   va_list args;
   va_start(args, format);
-  std::vfprintf(stderr, format, args);
+  (void)std::vfprintf(stderr, format, args);
   va_end(args);
 }

@@ -4,6 +4,7 @@
 
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstdio>
 #include <utility>
 
@@ -48,7 +49,7 @@ class Owned {
 };
 
 inline void CloseStream(std::FILE* f) {
-  std::fclose(f);
+  (void)std::fclose(f);
 }
 inline void CloseDescriptor(int fd) {
   ::close(fd);
@@ -58,8 +59,19 @@ inline void CloseDescriptor(int fd) {
 using File = Owned<std::FILE*, CloseStream>;
 using Descriptor = Owned<int, CloseDescriptor, -1>;
 
-inline File OpenFile(const char* path, const char* mode) {
-  return File(std::fopen(path, mode));
-}
+// OpenRegular opens |path| with the open(2) |flags| and keeps it only when
+// it is a regular file (symbolic links followed): a FIFO, a folder or a
+// device planted at a fixed path then fails like a file that cannot be
+// opened, instead of blocking the boot or feeding it endless bytes. The open
+// itself never blocks and the descriptor is closed on exec. With O_CREAT a
+// missing file is created (mode 0666 less the umask), never through a
+// dangling symbolic link; O_TRUNC empties it only once it is known to be
+// regular. On failure errno tells why: EISDIR for a folder, EINVAL for any
+// other kind of file. |size|, when given, receives the file's size.
+[[nodiscard]] Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size = nullptr);
+
+// OpenFile is OpenRegular as a stream, with an fopen(3) |mode| ("r", "w" or
+// "a", with "+" and "b" as fopen takes them).
+[[nodiscard]] File OpenFile(const char* path, const char* mode);
 
 }  // namespace keymgr

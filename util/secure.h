@@ -33,7 +33,7 @@ struct Secret {
   ~Secret() { OPENSSL_cleanse(bytes.data(), N); }
   std::uint8_t* data() { return bytes.data(); }
   const std::uint8_t* data() const { return bytes.data(); }
-  static constexpr std::size_t size() { return N; }
+  constexpr std::size_t size() const { return N; }
   std::uint8_t& operator[](std::size_t i) { return bytes[i]; }
   const std::uint8_t& operator[](std::size_t i) const { return bytes[i]; }
 };
@@ -49,7 +49,7 @@ struct SecretText {
   ~SecretText() { OPENSSL_cleanse(chars.data(), N); }
   char* data() { return chars.data(); }
   const char* c_str() const { return chars.data(); }
-  static constexpr std::size_t size() { return N; }
+  constexpr std::size_t size() const { return N; }
 };
 
 }  // namespace keymgr

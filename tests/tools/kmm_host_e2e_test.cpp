@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <chrono>
 #include <filesystem>
 #include <functional>
@@ -221,6 +222,114 @@ TEST(KmmHostE2e, KilledRegenerationsLeaveWholeFilesAndAWorkingTpm) {
   EXPECT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"}).status, 0);
   EXPECT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "1"}).status, 0);
   EXPECT_EQ(NewHandles(before).size(), 1u);
+  EvictNew(before);
+}
+
+// A FIFO, a folder, a link to /dev/zero and a dangling link at each fixed
+// path: every run ends by itself at once, with the exit status, lines and log
+// of a file that cannot be opened. A file the programs replace is replaced
+// whatever stands at its path, except a folder, which fails that step.
+TEST(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
+  namespace fs = std::filesystem;
+  StartRegenerationTest();
+  const auto before = NewHandles();
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN, H = KEYMGR_TEST_KMM_HOST_BIN,
+                    gone = InRoot("/gone");
+  WriteFile(InRoot("/d/a"), "a");
+  WriteFile(kManifestPath, InRoot("/d/a") + "\n");
+  WriteFile(kDmsetupPath, *ReadFile(KEYMGR_TEST_SOURCE_DIR "/tests/kmm/data/dmsetup"));
+  ASSERT_EQ(test::Run({K, "hash"}).status, 0);
+  std::map<std::string, std::string> healthy = {{kBootLogPath, "OLD\n"}};
+  const auto restore = [&] {
+    for (const auto& [path, bytes] : healthy) {
+      fs::remove_all(path);
+      WriteFile(path, bytes);
+    }
+  };
+  const auto snapshot = [&] {
+    for (const char* path : {KEYMGR_EEPROM_PATH, kManifestPath, kDigestFilePath, kKeyIdPath,
+                             kKeyPwdPath, kStoredOokPath, kScDigestPath, kDmsetupPath}) {
+      healthy[path] = *ReadFile(path);
+    }
+  };
+  ASSERT_EQ(test::Run({H, "3"}).status, 0);
+  snapshot();
+
+  const struct {
+    const char* name;
+    int error;  // what a read of it fails with
+    std::function<void(const std::string&)> plant;
+  } kinds[] = {
+      {"FIFO", EINVAL, [](const std::string& p) { mkfifo(p.c_str(), 0600); }},
+      {"folder", EISDIR, [](const std::string& p) { fs::create_directory(p); }},
+      {"link to /dev/zero", EINVAL,
+       [](const std::string& p) { fs::create_symlink("/dev/zero", p); }},
+      {"dangling link", ENOENT, [&](const std::string& p) { fs::create_symlink(gone, p); }},
+  };
+  const std::string on = "SFE_003 - [4]\n", dtFail = on + "DT=FAIL\nNormal Boot Error!!\n";
+  const std::string log = std::string("file[") + kBootLogPath + "] open error!!\n";
+  for (const auto& kind : kinds) {
+    const bool folder = kind.error == EISDIR;
+    const std::string e = std::to_string(kind.error);
+    // A key file that cannot be replaced fails the regeneration at its step.
+    const auto written = [&](const char* name) {
+      return folder ? std::string("Failed to open ") + name + "\nGenerate Store Key Error!!!\n"
+                    : std::string("Successed to open ") + name + "\n";
+    };
+    const struct {
+      const char* name;
+      std::string path;
+      std::vector<std::string> args;
+      int status;
+      std::string out, log;  // |out| appears in the output; |log| is the log after
+    } rows[] = {
+        // clang-format off
+        {"manifest", kManifestPath, {K}, 1, on + kManifestPath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
+        {"digest file", kDigestFilePath, {K}, 1, on + kDigestFilePath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
+        {"digest file rebuilt", kDigestFilePath, {K, "hash"}, 0, folder ? kDigestFilePath + std::string(" open error!!!\n") : "", "OLD\n"},
+        {"boot log started", kBootLogPath, {K}, 0, on + log, ""},
+        {"boot log appended", kBootLogPath, {H, "1", "1"}, 0, "Success [HDD]!!\n" + on + log, ""},
+        {"EEPROM image", KEYMGR_EEPROM_PATH, {K}, 0, "Read Error [-" + e + "] - SFE CONF from EEPROM !!!\n", "OLD\n"},
+        {"EEPROM image written", KEYMGR_EEPROM_PATH, {H, "3"}, 1, "Write error - Message Digest to EEPROM !!!\n", "OLD\n"},
+        {"key identity", kKeyIdPath, {H, "1", "1"}, 1, "=\n\nVKT_DTC_AES_Init Failed.\nDecrypt Store Key Error!!\n" + dtFail, "OLD\nDT=FAIL\n"},
+        {"key identity written", kKeyIdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddkeyid"), "OLD\n"},
+        {"key password", kKeyPwdPath, {H, "1", "1"}, 1, "Failed to decrypt OOK.\n", "OLD\nDT=FAIL\n"},
+        {"key password written", kKeyPwdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddpwd"), "OLD\n"},
+        {"sealed one-off key", kStoredOokPath, {H, "1", "1"}, 1, "Failed to open keymgr.ook\nDecrypt Store Key Error!!\n" + dtFail, "OLD\nDT=FAIL\n"},
+        {"sealed one-off key written", kStoredOokPath, {H, "3"}, folder ? 1 : 0, written("keymgr.ook"), "OLD\n"},
+        {"SC digest copy", kScDigestPath, {H, "1", "1"}, 1, kScDigestPath + std::string(" open error!!!\nGet Message Digest Error from HDD!!\n") + dtFail, "OLD\nDT=FAIL\n"},
+        {"SC digest copy written", kScDigestPath, {H, "3"}, 0, (folder ? kScDigestPath + std::string(" open error!!!\n") : "") + "SC Digest is created!!\n", "OLD\n"},
+        {"disk-mapper tool", kDmsetupPath, {H, "dmsetup"}, 1, std::string("file[") + kDmsetupPath + (kind.error == ENOENT ? "] status error : " : "] open error : ") + e + "\n", "OLD\n"},
+        // clang-format on
+    };
+    for (const auto& row : rows) {
+      SCOPED_TRACE(std::string(kind.name) + " at the " + row.name);
+      restore();
+      fs::remove(row.path);
+      kind.plant(row.path);
+      std::vector<std::string> args = {"timeout", "10"};
+      args.insert(args.end(), row.args.begin(), row.args.end());
+      const RunResult run = test::Run(args);
+      EXPECT_EQ(run.status, row.status) << run.out;
+      EXPECT_NE(run.out.find(row.out), std::string::npos) << run.out;
+      if (row.path != kBootLogPath) {
+        EXPECT_EQ(ReadFile(kBootLogPath), row.log);
+      }
+      // Replaced, or left as it was; nothing is written through a link.
+      const bool writes = row.args.back() == "hash" || row.args.back() == "3";
+      EXPECT_EQ(fs::is_regular_file(fs::symlink_status(row.path)),
+                writes && !folder && row.path != KEYMGR_EEPROM_PATH);
+      EXPECT_FALSE(fs::exists(gone));
+      // A regeneration that went through is the healthy state from now on.
+      if (row.args.back() == "3" && (run.status != 0 || folder)) {
+        restore();
+        ASSERT_EQ(test::Run({H, "3"}).status, 0);
+      }
+      if (row.args.back() == "3") {
+        snapshot();
+      }
+    }
+  }
   EvictNew(before);
 }
 

@@ -1,0 +1,123 @@
+// The key files and the normal-boot proof over the fake EEPROM and key
+// manager: a device that is blank, or regenerated and then altered from the
+// input (key files and keymgr.cs rewritten or removed, EEPROM bytes
+// overwritten, EEPROM ranges and key-manager calls made to fail, a TPM key
+// made for whatever identity and password the files hold), then
+// KeyManage(1, 1). Untouched key material proves, and the result and the DT
+// line agree.
+#include <fuzzer/FuzzedDataProvider.h>
+#include <kmm/kmm.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <string>
+
+#include "crypto/hash.h"
+#include "platform/eeprom_map.h"
+#include "support/fake_platform.h"
+#include "util/bytes.h"
+#include "util/paths.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using namespace keymgr;
+
+constexpr const char* kFiles[] = {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath};
+
+std::string Read(const char* path) {
+  std::ifstream in(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), {}};
+}
+
+void Write(const char* path, const std::string& bytes) {
+  std::ofstream(path, std::ios::binary | std::ios::trunc)
+      .write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+}
+
+// Md5OfHex is the key manager's name for 20 bytes of a key file: the MD5 of
+// their hex text.
+std::string Md5OfHex(const char* path) {
+  std::string bytes = Read(path);
+  bytes.resize(20);
+  char hex[41] = {};
+  std::uint8_t digest[16] = {};
+  (void)BytesToHex(reinterpret_cast<const std::uint8_t*>(bytes.data()), 20, hex, sizeof(hex));
+  (void)Md5OfString(hex, digest);
+  return {reinterpret_cast<const char*>(digest), sizeof(digest)};
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+  fs::create_directories(fs::path(kKeyIdPath).parent_path());
+  fs::create_directories(fs::path(kBootLogPath).parent_path());
+  // Every step of the flows prints a line; only failures of the checks below
+  // and sanitizer reports matter here.
+  return std::freopen("/dev/null", "w", stdout) != nullptr ? 0 : 1;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+  FuzzedDataProvider in(data, size);
+  test::FakeEeprom& eeprom = test::Eeprom();
+  test::FakeKeyManager& keyManager = test::KeyManager();
+  eeprom.Reset();
+  keyManager.Reset();
+  for (const char* path : {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath, kBootLogPath}) {
+    std::error_code ignored;
+    fs::remove(path, ignored);
+  }
+  std::srand(1);
+  eeprom.image[eeprom::kSfeConfOffset] = eeprom::kSfe003Mask;  // DT lines reach the log
+  const bool regenerated = in.ConsumeBool();
+  if (regenerated && KeyManage(KMM_OPTION_REGENERATE, 0) == nullptr) {
+    std::abort();
+  }
+
+  bool altered = false;
+  while (in.remaining_bytes() > 0) {
+    altered = true;
+    switch (in.ConsumeIntegralInRange(0, 4)) {
+      case 0: {
+        const char* path = kFiles[in.ConsumeIntegralInRange(0, 3)];
+        if (in.ConsumeBool()) {
+          fs::remove(path);
+        } else {
+          Write(path, in.ConsumeRandomLengthString(400));
+        }
+        break;
+      }
+      case 1: {
+        const auto offset = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize - 1);
+        const std::string bytes = in.ConsumeRandomLengthString(eeprom::kSize - offset);
+        std::memcpy(eeprom.image.data() + offset, bytes.data(), bytes.size());
+        break;
+      }
+      case 2:
+        eeprom.fault.begin = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize);
+        eeprom.fault.end = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize);
+        eeprom.fault.count = in.ConsumeIntegralInRange(0, 4);
+        break;
+      case 3:
+        keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0, 2);
+        break;
+      case 4:
+        keyManager.keys[Md5OfHex(kKeyIdPath)] = Md5OfHex(kKeyPwdPath);
+        break;
+    }
+  }
+
+  const KeyContext* context = KeyManage(KMM_OPTION_NORMAL_BOOT, 1);
+  const std::string log = Read(kBootLogPath);
+  if ((regenerated && !altered && context == nullptr) ||
+      (!log.empty() && log != (context != nullptr ? "DT=OK\n" : "DT=FAIL\n")) ||
+      (context != nullptr && (context->secretKeyLength != 48 || context->storeKeyLength != 48))) {
+    std::abort();
+  }
+  return 0;
+}

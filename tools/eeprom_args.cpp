@@ -1,0 +1,84 @@
+#include "tools/eeprom_args.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+#include "util/bytes.h"
+
+namespace keymgr::tools {
+
+namespace {
+
+// ParseNumber accepts a whole unsigned 32-bit number, decimal or with a 0x
+// prefix, and nothing else (no sign, no blanks, no trailing text).
+bool ParseNumber(const char* text, std::uint32_t* value) {
+  int base = 10;
+  if (text[0] == '0' && (text[1] == 'x' || text[1] == 'X')) {
+    base = 16;
+    text += 2;
+  }
+  const char* digits = base == 16 ? "0123456789abcdefABCDEF" : "0123456789";
+  if (*text == '\0' || std::strspn(text, digits) != std::strlen(text)) {
+    return false;
+  }
+  errno = 0;
+  char* end = nullptr;
+  const unsigned long long parsed = std::strtoull(text, &end, base);
+  if (errno != 0 || *end != '\0' || parsed > UINT32_MAX) {
+    return false;
+  }
+  *value = static_cast<std::uint32_t>(parsed);
+  return true;
+}
+
+// Decode turns |hex| (an even number of digits) into |bytes|.
+bool Decode(const char* hex, std::size_t length, std::span<std::uint8_t> bytes) {
+  for (std::size_t i = 0; i < length; ++i) {
+    const int high = HexDigitValue(hex[2 * i]);
+    const int low = HexDigitValue(hex[2 * i + 1]);
+    if (high < 0 || low < 0) {
+      return false;
+    }
+    bytes[i] = static_cast<std::uint8_t>(high << 4 | low);
+  }
+  return true;
+}
+
+}  // namespace
+
+EepromArgs ParseEepromArgs(int argc, const char* const* argv,
+                           std::span<std::uint8_t, eeprom::kSize> bytes) {
+  using Action = EepromArgs::Action;
+  EepromArgs args;
+  if (argc == 2 && std::strcmp(argv[1], "init") == 0) {
+    args.action = Action::kInit;
+    return args;
+  }
+  if (argc != 4) {
+    return args;
+  }
+  if (std::strcmp(argv[1], "read") == 0) {
+    std::uint32_t length = 0;
+    if (!ParseNumber(argv[2], &args.offset) || !ParseNumber(argv[3], &length)) {
+      return EepromArgs();
+    }
+    args.action = Action::kRead;
+    args.length = length;
+    return args;
+  }
+  if (std::strcmp(argv[1], "write") == 0) {
+    const std::size_t digits = std::strlen(argv[3]);
+    if (!ParseNumber(argv[2], &args.offset) || digits == 0 || digits % 2 != 0) {
+      return EepromArgs();
+    }
+    args.action = Action::kWrite;
+    args.length = digits / 2;
+    if (args.length <= bytes.size() && !Decode(argv[3], args.length, bytes)) {
+      return EepromArgs();
+    }
+  }
+  return args;
+}
+
+}  // namespace keymgr::tools
