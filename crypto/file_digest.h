@@ -18,7 +18,7 @@ inline constexpr std::size_t kFileDigestSize = 32;
 // Files are read this much at a time: enough that the system calls cost
 // little next to the hashing, little enough to stay in the CPU cache between
 // the read and the hash.
-inline constexpr std::size_t kFileReadChunk = 128 * 1024;
+inline constexpr std::size_t kFileReadChunk = std::size_t{128} * 1024;
 
 // FileHasher holds what hashing reuses from one file to the next: an aligned
 // read buffer of kFileReadChunk bytes and a hash context, both taken at the

@@ -128,9 +128,8 @@ TSS2_RC Transmit(TSS2_TCTI_CONTEXT* context, size_t size, const uint8_t* command
     const ssize_t put = ::send(tcti->socket.get(), command + sent, size - sent, MSG_NOSIGNAL);
     if (put > 0) {
       sent += static_cast<std::size_t>(put);
-    } else if (put < 0 && errno == EINTR) {
-      continue;
-    } else if (put < 0 && errno == EAGAIN && Wait(tcti->socket.get(), POLLOUT, deadline)) {
+    } else if (put < 0 && (errno == EINTR ||
+                           (errno == EAGAIN && Wait(tcti->socket.get(), POLLOUT, deadline)))) {
       continue;
     } else {
       tcti->socket.reset();
@@ -205,7 +204,7 @@ void Finalize(TSS2_TCTI_CONTEXT* context) {
   }
 }
 
-TSS2_RC NotImplemented(TSS2_TCTI_CONTEXT*) {
+TSS2_RC NotImplemented(TSS2_TCTI_CONTEXT* /*context*/) {
   return TSS2_TCTI_RC_NOT_IMPLEMENTED;
 }
 
