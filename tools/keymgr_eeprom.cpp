@@ -17,8 +17,8 @@
 #include "platform/eeprom.h"
 #include "platform/eeprom_map.h"
 #include "tools/eeprom_args.h"
+#include "util/owned.h"
 #include "util/paths.h"
-#include "util/secure.h"
 
 namespace {
 
@@ -58,11 +58,14 @@ int Init() {
   if (!MakeParents(keymgr::kEepromPath)) {
     return Fail("cannot create the directories of the EEPROM image");
   }
-  int fd = ::open(keymgr::kEepromPath, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-  if (fd < 0) {
+  // A FIFO or device planted at the path fails instead of blocking or
+  // taking the blank bytes.
+  const keymgr::Descriptor image =
+      keymgr::OpenRegular(keymgr::kEepromPath, O_WRONLY | O_CREAT | O_TRUNC);
+  if (!image) {
     return Fail("cannot create the EEPROM image");
   }
-  keymgr::ScopeExit closeFd([&] { ::close(fd); });
+  const int fd = image.get();
   static std::uint8_t blank[kImageSize];
   std::memset(blank, 0xFF, sizeof(blank));
   std::size_t done = 0;

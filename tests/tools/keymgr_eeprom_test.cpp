@@ -1,3 +1,6 @@
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <gtest/gtest.h>
 
 #include <sstream>
@@ -39,6 +42,11 @@ TEST(KeymgrEepromTest, InitWriteReadAndErrors) {
     EXPECT_TRUE(run.out.empty() && !run.err.empty()) << words;
   }
   EXPECT_EQ(keymgr::test::ReadFile(KEYMGR_EEPROM_PATH), std::string(32768, '\xFF'));
+  // A FIFO at the image's path fails at once instead of waiting for a reader.
+  ASSERT_EQ(::unlink(KEYMGR_EEPROM_PATH), 0);
+  ASSERT_EQ(::mkfifo(KEYMGR_EEPROM_PATH, 0600), 0);
+  EXPECT_EQ(Tool("init").status, 1);
+  EXPECT_EQ(::unlink(KEYMGR_EEPROM_PATH), 0);
 }
 
 }  // namespace
