@@ -50,7 +50,20 @@ set(CPACK_DEBIAN_PACKAGE_SECTION admin)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_SET_DESTDIR ON)
+set(CPACK_STRIP_FILES ON)
+# A cross build's toolchain file names the target's Debian architecture.
 if(KEYMGR_DEB_ARCHITECTURE)
   set(CPACK_DEBIAN_PACKAGE_ARCHITECTURE ${KEYMGR_DEB_ARCHITECTURE})
+endif()
+# A cross build's dpkg-shlibdeps finds the libraries the programs link in the
+# sysroot, and the packages holding them in the sysroot's own dpkg database
+# (dist/cpack_cross.cmake), never in the machine's.
+if(CMAKE_CROSSCOMPILING AND CMAKE_SYSROOT)
+  foreach(_dir lib usr/lib)
+    list(APPEND CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS
+         ${CMAKE_SYSROOT}/${_dir}/${CMAKE_LIBRARY_ARCHITECTURE})
+  endforeach()
+  set(CPACK_KEYMGR_DPKG_ADMINDIR ${CMAKE_SYSROOT}/var/lib/dpkg)
+  set(CPACK_PROJECT_CONFIG_FILE ${PROJECT_SOURCE_DIR}/dist/cpack_cross.cmake)
 endif()
 include(CPack)

@@ -63,25 +63,17 @@ case "${1:-}" in
     export TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1
     ;;
   --target)
-    case "${2:-}" in
-      aarch64) triplet=aarch64-linux-gnu debian_arch=arm64 cpu=aarch64 ;;
-      armhf) triplet=arm-linux-gnueabihf debian_arch=armhf cpu=arm ;;
-      *) usage ;;
-    esac
-    build=build-$2
-    root=${KEYMGR_TEST_ROOT:-/tmp/keymgr-test-$2}
-    extra=(--toolchain "cmake/toolchains/$triplet.cmake" -DKEYMGR_SYSROOT="$PWD/$build/sysroot")
+    build=build-${2:-}
+    root=${KEYMGR_TEST_ROOT:-/tmp/keymgr-test-${2:-}}
+    # shellcheck source=scripts/cross-setup.sh
+    . scripts/cross-setup.sh "${2:-}" "$build"
+    extra=("${cross_args[@]}")
+    register_binfmt "$cpu"
     ;;
   *) usage ;;
 esac
-
-if [ -n "${triplet:-}" ]; then
-  bash scripts/install-deps.sh "g++-$triplet" qemu-user-static
-  bash scripts/cross-sysroot.sh "$debian_arch" "$build/sysroot"
-  register_binfmt "$cpu"
-else
-  bash scripts/install-deps.sh
-fi
+# A cross build has installed what it needs along with its cross compiler.
+[ -n "${cross_args:-}" ] || bash scripts/install-deps.sh
 
 # The suite installs tests/kmm/data/dmsetup as the disk-mapper tool, so the
 # build expects that file's digest.

@@ -58,7 +58,9 @@ Status AtomicFile::Open(const char* path, mode_t mode) {
   fd_.reset(::openat(dirFd_.get(), ".", O_TMPFILE | O_WRONLY | O_CLOEXEC, mode));
   anonymous_ = static_cast<bool>(fd_);
   if (!fd_ && NoAnonymousFiles(errno)) {
-    std::array<char, kNameSize> templ{};
+    // The length check above leaves room for the dot and the suffix; the
+    // spare bytes let GCC see, at -Os too, that the name is never cut short.
+    std::array<char, kNameSize + 16> templ{};
     (void)std::snprintf(templ.data(), templ.size(), "%s/.%s.XXXXXX", dir.data(), base_);
     fd_.reset(::mkostemp(templ.data(), O_CLOEXEC));
     if (fd_) {

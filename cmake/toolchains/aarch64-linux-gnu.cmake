@@ -5,4 +5,5 @@
 set(CMAKE_SYSTEM_PROCESSOR aarch64)
 set(KEYMGR_CROSS_TRIPLET aarch64-linux-gnu)
 set(KEYMGR_CROSS_QEMU qemu-aarch64-static)
+set(KEYMGR_DEB_ARCHITECTURE arm64)
 include(${CMAKE_CURRENT_LIST_DIR}/linux-gnu-cross.cmake)

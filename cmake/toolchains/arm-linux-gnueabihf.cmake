@@ -7,6 +7,7 @@
 set(CMAKE_SYSTEM_PROCESSOR arm)
 set(KEYMGR_CROSS_TRIPLET arm-linux-gnueabihf)
 set(KEYMGR_CROSS_QEMU qemu-arm-static)
+set(KEYMGR_DEB_ARCHITECTURE armhf)
 # GCC notes where the passing of some types changed in GCC 7.1; every object
 # here comes from one compiler.
 set(CMAKE_CXX_FLAGS_INIT -Wno-psabi)

@@ -1,5 +1,6 @@
 # The part the ARM toolchain files share: Debian's cross compilers for
 # KEYMGR_CROSS_TRIPLET, and qemu-user (KEYMGR_CROSS_QEMU) to run what they build.
+# KEYMGR_DEB_ARCHITECTURE is the Debian architecture of the package they make.
 #
 # The target's libraries (OpenSSL, tpm2-tss, GoogleTest) come from
 # KEYMGR_SYSROOT, a folder of the target's Debian packages such as
