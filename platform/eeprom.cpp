@@ -8,8 +8,8 @@
 #include <cerrno>
 #include <climits>
 #include <cstdint>
+#include <cstdlib>
 #include <cstring>
-#include <vector>
 
 #include "platform/eeprom_map.h"
 #include "util/io.h"
@@ -35,6 +35,11 @@ Status OpenImage(int flags, Image& image) {
   image.fd = keymgr::OpenRegular(keymgr::kEepromPath, flags, &image.size);
   return image.fd ? Status() : ErrnoFailure("open");
 }
+
+void FreeBytes(std::uint8_t* bytes) {
+  std::free(bytes);
+}
+using Scratch = keymgr::Owned<std::uint8_t*, FreeBytes>;
 
 // CheckRequest rejects another device, a missing buffer and a length that
 // does not fit the int result.
@@ -81,14 +86,19 @@ Status ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* d
     return Status();
   }
   // Read into a scratch buffer so a failed read leaves |dst| untouched; the
-  // bytes may be key material, so the scratch copy is wiped.
-  std::vector<std::uint8_t> scratch(length);
-  keymgr::ScopeExit wipe([&] { OPENSSL_cleanse(scratch.data(), scratch.size()); });
-  if (Status status = MoveAt(::pread, "pread", image.fd.get(), scratch.data(), length, offset);
+  // bytes may be key material, so the scratch copy is wiped. It comes from
+  // malloc, not new, so that keymgr does not load the C++ runtime library
+  // at start.
+  const Scratch scratch(static_cast<std::uint8_t*>(std::malloc(length)));
+  if (!scratch) {
+    return ErrnoFailure("malloc", ENOMEM);
+  }
+  keymgr::ScopeExit wipe([&] { OPENSSL_cleanse(scratch.get(), length); });
+  if (Status status = MoveAt(::pread, "pread", image.fd.get(), scratch.get(), length, offset);
       !status.ok()) {
     return status;
   }
-  std::memcpy(dst, scratch.data(), length);
+  std::memcpy(dst, scratch.get(), length);
   return Status();
 }
 

@@ -12,8 +12,9 @@ void DebugPrint(const char* format, ...) {
 }
 
 bool DiagnosticsOn() {
-  static const bool on = std::getenv("KEYMGR_DEBUG") != nullptr;
-  return on;
+  // Read each time: a cached value would need a guarded static, and with it
+  // the C++ runtime library at every start of keymgr.
+  return std::getenv("KEYMGR_DEBUG") != nullptr;
 }
 
 void DiagnosticPrint(const char* format, ...) {
