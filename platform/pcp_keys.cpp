@@ -351,20 +351,8 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
       return status;
     }
   }
-  TPMT_SYM_DEF symmetric{};
-  symmetric.algorithm = TPM2_ALG_AES;
-  symmetric.keyBits.aes = 128;
-  symmetric.mode.aes = TPM2_ALG_CFB;
   ESYS_TR bound = ESYS_TR_NONE;
-  if (Status status = Run(
-          tpm, "Esys_StartAuthSession",
-          [&] {
-            return Esys_StartAuthSession_Async(tpm.ctx(), ESYS_TR_NONE, tr, ESYS_TR_NONE,
-                                               ESYS_TR_NONE, ESYS_TR_NONE, nullptr, TPM2_SE_HMAC,
-                                               &symmetric, TPM2_ALG_SHA256);
-          },
-          [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), &bound); });
-      !status.ok()) {
+  if (Status status = StartHmacSession(tpm, ESYS_TR_NONE, tr, &bound); !status.ok()) {
     return status;
   }
   TransientObject session(tpm.Object(bound));

@@ -374,25 +374,29 @@ Status UseParent(Connection& tpm) {
   return tpm.broken ? Refused("TPM connection lost") : CreatePrimary(tpm);
 }
 
+Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session) {
+  TPMT_SYM_DEF symmetric{};
+  symmetric.algorithm = TPM2_ALG_AES;
+  symmetric.keyBits.aes = 128;
+  symmetric.mode.aes = TPM2_ALG_CFB;
+  *session = ESYS_TR_NONE;
+  return Run(
+      tpm, "Esys_StartAuthSession",
+      [&] {
+        return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
+                                           ESYS_TR_NONE, nullptr, TPM2_SE_HMAC, &symmetric,
+                                           TPM2_ALG_SHA256);
+      },
+      [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });
+}
+
 Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes) {
   if (!tpm.session) {
     if (Status status = UseParent(tpm); !status.ok()) {
       return status;
     }
-    TPMT_SYM_DEF symmetric{};
-    symmetric.algorithm = TPM2_ALG_AES;
-    symmetric.keyBits.aes = 128;
-    symmetric.mode.aes = TPM2_ALG_CFB;
     ESYS_TR session = ESYS_TR_NONE;
-    if (Status status = Run(
-            tpm, "Esys_StartAuthSession",
-            [&] {
-              return Esys_StartAuthSession_Async(tpm.ctx(), tpm.Parent(), ESYS_TR_NONE,
-                                                 ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, nullptr,
-                                                 TPM2_SE_HMAC, &symmetric, TPM2_ALG_SHA256);
-            },
-            [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), &session); });
-        !status.ok()) {
+    if (Status status = StartHmacSession(tpm, tpm.Parent(), ESYS_TR_NONE, &session); !status.ok()) {
       return status;
     }
     tpm.session.reset(tpm.Object(session));

@@ -157,6 +157,11 @@ Status EvictPersistent(Connection& tpm, TPM2_HANDLE handle);
 // template, else a primary created from that template (the same key).
 Status UseParent(Connection& tpm);
 
+// StartHmacSession starts an HMAC session with AES-128-CFB parameter
+// encryption, salted by |tpmKey| and bound to |bind| (either may be
+// ESYS_TR_NONE), and leaves it in |session|. The caller owns the session.
+Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session);
+
 // UseSaltedSession makes the connection's HMAC session available, salted by
 // the parent, and sets its parameter encryption to |attributes|
 // (TPMA_SESSION_DECRYPT: the command's first parameter; TPMA_SESSION_ENCRYPT:
