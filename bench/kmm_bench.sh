@@ -15,7 +15,10 @@ tcti=$(build_setting "$build" KEYMGR_TCTI)
 host=$build/tools/kmm-host
 eeprom=$build/tools/keymgr-eeprom
 [ -n "$root" ] || { echo "the build has no KEYMGR_ROOT sandbox" >&2; exit 1; }
-[ -x "$host" ] && [ -x "$eeprom" ] || { echo "build kmm-host and keymgr-eeprom first" >&2; exit 1; }
+if [ ! -x "$host" ] || [ ! -x "$eeprom" ]; then
+  echo "build kmm-host and keymgr-eeprom first" >&2
+  exit 1
+fi
 
 mkdir -p "$root/run" "$root/quorvan/hidden" "$root/quorvan/spool/log"
 scripts/swtpm-fixture.sh start "$tcti" >/dev/null

@@ -1,3 +1,4 @@
+# shellcheck shell=bash
 # Shared by the benchmark scripts: sourced, not run.
 
 # build_setting BUILD_DIR NAME prints a cache variable of a configured build.
@@ -18,6 +19,13 @@ wall_ms() {
 # median prints the median of the numbers on standard input, one a line.
 median() {
   sort -g | awk '{ t[NR] = $1 } END { print t[int((NR + 1) / 2)] }'
+}
+
+# median_of "N N ...": the median of a space-separated list of numbers.
+median_of() {
+  local -a values
+  read -ra values <<<"$1"
+  printf '%s\n' "${values[@]}" | median
 }
 
 # median_ms RUNS CMD...: the median of RUNS runs of wall_ms CMD.

@@ -74,10 +74,10 @@ for s in "${!sets[@]}"; do
     times[openssl]+="$(wall_ms openssl dgst -sha256 "${files[@]}") "
     times[sha256sum]+="$(wall_ms sha256sum "${files[@]}") "
   done
-  ossl=$(printf '%s\n' ${times[openssl]} | median)
-  sums=$(printf '%s\n' ${times[sha256sum]} | median)
+  ossl=$(median_of "${times[openssl]}")
+  sums=$(median_of "${times[sha256sum]}")
   for p in "${!programs[@]}"; do
-    mine=$(printf '%s\n' ${times[$p]} | median)
+    mine=$(median_of "${times[$p]}")
     peak=$(peak_mib "${programs[$p]}")
     outcome=$(cat "$root/quorvan/spool/log/keymgr.log")
     awk -v set="${sets[$s]}" -v label="${labels[$p]}" -v mine="$mine" -v ossl="$ossl" \
@@ -99,7 +99,7 @@ for _ in $(seq $((3 * runs))); do
   closed[floor]+="$(wall_ms /bin/true) "
 done
 for p in "${!programs[@]}"; do
-  printf '%-37s %8.3f ms\n' "gate closed, ${labels[$p]}" "$(printf '%s\n' ${closed[$p]} | median)"
+  printf '%-37s %8.3f ms\n' "gate closed, ${labels[$p]}" "$(median_of "${closed[$p]}")"
 done
-printf '%-37s %8.3f ms\n' "/bin/true, for scale" "$(printf '%s\n' ${closed[floor]} | median)"
+printf '%-37s %8.3f ms\n' "/bin/true, for scale" "$(median_of "${closed[floor]}")"
 echo "medians of $runs paired runs ($((3 * runs)) with the gate closed), warm cache"

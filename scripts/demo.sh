@@ -6,7 +6,7 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 
 root=/tmp/keymgr-demo
-build=build-demo
+build="build-demo"
 jobs=${JOBS:-$(nproc)}
 
 echo "== Installing missing build dependencies (if any)"
@@ -97,7 +97,7 @@ cat "$root/quorvan/spool/log/keymgr.log"
 echo "== Altering keymgr.hddpwd (the TPM key's password) and proving again"
 pwd_file="$root/quorvan/hidden/keymgr.hddpwd"
 first=$(od -An -tu1 -N1 "$pwd_file" | tr -d ' ')
-printf "\\x$(printf %02x $((first ^ 0xFF)))" | dd of="$pwd_file" bs=1 conv=notrunc status=none
+printf '%b' "\\x$(printf %02x $((first ^ 0xFF)))" | dd of="$pwd_file" bs=1 conv=notrunc status=none
 status=0
 "$kmm_host" 1 1 || status=$?
 echo "Exit status: $status"

@@ -13,7 +13,7 @@ cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 
 seconds=${1:-30}
-build=build-fuzz
+build="build-fuzz"
 root=${KEYMGR_FUZZ_ROOT:-/dev/shm/keymgr-fuzz}
 
 cmake -S . -B "$build" -G Ninja -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ \

@@ -32,6 +32,7 @@ fi
 hardening-check "${skip[@]}" "$@"
 for elf in "$@"; do
   # x86-64 probes with "orq $0x0,(%rsp)", aarch64 with "str xzr, [sp, ...]".
+  # shellcheck disable=SC2016 # the $ is the assembler's, not the shell's
   if objdump -d --no-show-raw-insn "$elf" |
     grep -E 'or[q]?[[:space:]]+\$0x0,\(%rsp\)|str[[:space:]]+xzr, \[sp' >/dev/null; then
     exit 0
