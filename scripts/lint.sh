@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # Static analysis of the product code: clang-tidy with the checked-in
 # .clang-tidy, then cppcheck, both over the compile commands of a product
-# build configured in build-lint/. Fails on any finding.
+# build configured in build-lint/; then shellcheck over the scripts. Fails on
+# any finding.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
@@ -22,4 +23,6 @@ fi
 echo "== cppcheck"
 cppcheck --project="$build/compile_commands.json" --enable=warning,portability,performance \
   --std=c++20 --inline-suppr --error-exitcode=1 --quiet -j "$(nproc)"
+echo "== shellcheck"
+shellcheck scripts/*.sh bench/*.sh tests/dist/*.sh .ci/run
 echo "lint: clean"
