@@ -45,17 +45,19 @@ bool ReadKeyFile(const char* path, std::uint8_t* dst, std::size_t size) {
   return true;
 }
 
+// Said prints a step's line, "Successed to " or "Failed to " then |step| and
+// |object|, and returns |ok|.
+bool Said(bool ok, const char* step, const char* object = "") {
+  DebugPrint("%s to %s%s\n", ok ? "Successed" : "Failed", step, object);
+  return ok;
+}
+
 // WriteKeyFile replaces |path| with |size| bytes of |src|, reporting it under
 // the file's short |name|. The whole replacement counts as the open: the
 // success line follows only once the new file is durably in place, and a
 // failure leaves the old file whole.
 bool WriteKeyFile(const char* path, const char* name, const std::uint8_t* src, std::size_t size) {
-  if (!keymgr::ReplaceFile(path, src, size, keymgr::kSecretFileMode).ok()) {
-    DebugPrint("Failed to open %s\n", name);
-    return false;
-  }
-  DebugPrint("Successed to open %s\n", name);
-  return true;
+  return Said(keymgr::ReplaceFile(path, src, size, keymgr::kSecretFileMode).ok(), "open ", name);
 }
 
 // BindOneOffKey copies the OOK into the context and binds the AES key
@@ -117,41 +119,24 @@ int GenerateStoreKey(KeyContext* context) {
   }
   (void)pcp_evict_stale_keys(hadIdentity ? nameDigest.data() : nullptr);
   if (hadIdentity) {
-    if (pcp_delete_key(nameDigest.data(), 0) == 0) {
-      DebugPrint("Successed to delete ID/PWD in TPM.\n");
-    } else {
-      DebugPrint("Failed to delete ID/PWD in TPM.\n");
-    }
+    Said(pcp_delete_key(nameDigest.data(), 0) == 0, "delete ID/PWD in TPM.");
   }
 
   // A failed draw is reported and the buffer keeps what it had.
-  if (pcp_getRandomBytes(kOneOffKeySize, ook.data()) == 0) {
-    DebugPrint("Successed to generate one_off_key by TPM.\n");
-  } else {
-    DebugPrint("Failed to generate one_off_key by TPM.\n");
-  }
-  if (pcp_getRandomBytes(kTpmSecretSize, identity.data()) == 0) {
-    DebugPrint("Successed to generate user_name_hex.\n");
-  } else {
-    DebugPrint("Failed to generate user_name_hex.\n");
-  }
+  Said(pcp_getRandomBytes(kOneOffKeySize, ook.data()) == 0, "generate one_off_key by TPM.");
+  Said(pcp_getRandomBytes(kTpmSecretSize, identity.data()) == 0, "generate user_name_hex.");
   HexOf(identity, nameHex);
   Md5OfString(nameHex.c_str(), nameDigest.data());
-  if (pcp_getRandomBytes(kTpmSecretSize, password.data()) == 0) {
-    DebugPrint("Successed to generate user_pass_hex.\n");
-  } else {
-    DebugPrint("Failed to generate user_pass_hex.\n");
-  }
+  Said(pcp_getRandomBytes(kTpmSecretSize, password.data()) == 0, "generate user_pass_hex.");
   HexOf(password, passHex);
   Md5OfString(passHex.c_str(), passDigest.data());
 
   // The TPM key lives under the MD5 digests of the hex texts; the fragment
   // is sealed under the texts themselves.
-  if (pcp_create_key(nameDigest.data(), passDigest.data(), kTpmKeyBits, 0) != 0) {
-    DebugPrint("Failed to create OOK.\n");
+  if (!Said(pcp_create_key(nameDigest.data(), passDigest.data(), kTpmKeyBits, 0) == 0,
+            "create OOK.")) {
     return 1;
   }
-  DebugPrint("Successed to create OOK.\n");
   // Until its identity is on disk nothing can ever name the new key again:
   // a failure before that evicts it (a leak fix, not a rollback).
   bool identityStored = false;
@@ -160,12 +145,11 @@ int GenerateStoreKey(KeyContext* context) {
       (void)pcp_delete_key(nameDigest.data(), 0);
     }
   });
-  if (pcp_encryptDataFragment(nameHex.c_str(), passHex.c_str(), ook.data(), kOneOffKeySize,
-                              storedOok.data(), &storedOokSize) != 0) {
-    DebugPrint("Failed to encrypt Stored-OOK.\n");
+  if (!Said(pcp_encryptDataFragment(nameHex.c_str(), passHex.c_str(), ook.data(), kOneOffKeySize,
+                                    storedOok.data(), &storedOokSize) == 0,
+            "encrypt Stored-OOK.")) {
     return 1;
   }
-  DebugPrint("Successed to encrypt Stored-OOK.\n");
 
   // Fixed order, each file replaced whole: a failure leaves a mixed
   // generation, every file of it intact.
@@ -208,20 +192,16 @@ int DecryptStoreKey(KeyContext* context) {
     // A missing password file leaves the password cleared; the TPM then
     // refuses it and the digest check rejects the result.
     ReadKeyFile(keymgr::kKeyPwdPath, password.data(), kTpmSecretSize);
-    if (!ReadKeyFile(keymgr::kStoredOokPath, storedOok.data(), storedOok.size())) {
-      DebugPrint("Failed to open keymgr.ook\n");
+    if (!Said(ReadKeyFile(keymgr::kStoredOokPath, storedOok.data(), storedOok.size()),
+              "open keymgr.ook")) {
       return 1;
     }
-    DebugPrint("Successed to open keymgr.ook\n");
     HexOf(identity, nameHex);
     HexOf(password, passHex);
     // Only the first 268 bytes of the file are the sealed fragment.
-    if (pcp_decryptDataFragment(nameHex.c_str(), passHex.c_str(), storedOok.data(),
-                                kStoredOokPassed, ook.data(), &ookSize) == 0) {
-      DebugPrint("Successed to decrypt OOK.\n");
-    } else {
-      DebugPrint("Failed to decrypt OOK.\n");
-    }
+    Said(pcp_decryptDataFragment(nameHex.c_str(), passHex.c_str(), storedOok.data(),
+                                 kStoredOokPassed, ook.data(), &ookSize) == 0,
+         "decrypt OOK.");
     // Shown on every call, as a diagnostic; the digest check decides. With
     // the store key from EEPROM the one-off key gives away the secret key,
     // so a production build may show the line without its bytes.
