@@ -8,29 +8,31 @@
 
 using namespace keymgr::kmm;
 
-int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int store,
-                          std::uint8_t* digest) {
+int HashRecord(const ProtectedKey* in, std::uint32_t inLength, ProtectedKey* out,
+               std::uint32_t* outLength) {
   std::uint32_t result = 0;
-  std::uint32_t digestLength = kDigestSize;
-  std::array<std::uint8_t, kDigestSize> digestArea{};
-  ProtectedKey digestKey;
-  Bind(&digestKey, digestArea.data(), kDigestSize);
-
   Container container(VKT_DTC_CreateCryptoContainer());
   if (!container) {
     // Creation reports no code; the line shows the result so far, 0.
     DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
     return 1;
   }
-  // The input is always the 32-byte secret key, whatever length was passed.
-  result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, &secretKey, kDigestSize, &digestKey,
-                           &digestLength);
-  if (result != 0) {
+  result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, in, inLength, out, outLength);
+  if (result != 0 || *outLength != kDigestSize) {
     DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
     return 1;
   }
-  if (digestLength != kDigestSize) {
-    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+  return 0;
+}
+
+int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int store,
+                          std::uint8_t* digest) {
+  std::uint32_t digestLength = kDigestSize;
+  std::array<std::uint8_t, kDigestSize> digestArea{};
+  ProtectedKey digestKey;
+  Bind(&digestKey, digestArea.data(), kDigestSize);
+  // The input is always the 32-byte secret key, whatever length was passed.
+  if (HashRecord(&secretKey, kDigestSize, &digestKey, &digestLength) != 0) {
     return 1;
   }
   for (std::uint32_t i = 0; i < kDigestSize; ++i) {
@@ -51,7 +53,6 @@ int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int s
       return 1;
     }
   }
-  container.reset();
   DebugPrint("SC Digest is created!!\n");
   return 0;
 }

@@ -109,6 +109,13 @@ inline void Bind(ProtectedKey* record, std::uint8_t* bytes, std::uint32_t length
 // have run GenerateSeedKey. Returns 0, or 1 with a message.
 [[nodiscard]] int GenerateSecretKey(KeyContext* context);
 
+// HashRecord hashes |inLength| bytes of |in| into |out| in a container of
+// its own and sets |*outLength| to the bytes produced; |*outLength| holds
+// |out|'s capacity on entry. Returns 0, or 1 with a message when the hash
+// fails or does not give 32 bytes.
+[[nodiscard]] int HashRecord(const ProtectedKey* in, std::uint32_t inLength, ProtectedKey* out,
+                             std::uint32_t* outLength);
+
 // GenerateMessageDigest hashes the first 32 bytes behind |secretKey| into the
 // 32 bytes at |digest|; with |store| non-zero it also writes the digest to
 // EEPROM and to "keymgr.cs". |length| is not consulted. The caller must zero

@@ -78,29 +78,15 @@ int GenerateSeedKey(KeyContext* context) {
 }
 
 int GenerateSecretKey(KeyContext* context) {
-  std::uint32_t result = 0;
+  static_assert(kSecretKeySize == kDigestSize);
   context->secretKeyLength = kSecretKeySize;  // capacity going in
   Attach(&context->secretKeyPK, context->secretKeyBytes);
-
-  Container container(VKT_DTC_CreateCryptoContainer());
-  if (!container) {
-    // Creation reports no code; the line shows the result so far, 0.
-    DebugPrint("VKT_DTC_CreateCryptoContainer Failed. nRes=0x%08x\n", result);
-    return 1;
-  }
-  result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, &context->seedKeyPK, kSeedKeySize,
-                           &context->secretKeyPK, &context->secretKeyLength);
-  if (result != 0) {
-    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
-    return 1;
-  }
-  if (context->secretKeyLength != kSecretKeySize) {
-    DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
+  if (HashRecord(&context->seedKeyPK, kSeedKeySize, &context->secretKeyPK,
+                 &context->secretKeyLength) != 0) {
     return 1;
   }
   // The sealing later in this regeneration uses this reference as it is.
   FetchConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
-  container.reset();
   DebugPrint("Secret Key is created!!\n");
   return 0;
 }
