@@ -1,5 +1,8 @@
 #include "bootlog/boot_status.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <cstdio>
@@ -9,8 +12,10 @@
 #include "platform/eeprom.h"
 #include "platform/eeprom_map.h"
 #include "util/debug_print.h"
+#include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"
+#include "util/status.h"
 
 namespace {
 
@@ -59,16 +64,33 @@ void WriteBootStatus(unsigned int code) {
   char path[keymgr::kPathBufferSize] = {};
   std::memcpy(path, keymgr::kBootLogPath, sizeof(keymgr::kBootLogPath));
 
-  keymgr::File log = keymgr::OpenFile(path, startsLog ? "w" : "a+");
+  // The log's folder may be writable by other accounts, so the log must be
+  // a file of its own: a symbolic link or hard link planted there would
+  // have a root boot write into another file, and a device or FIFO is never
+  // opened at all.
+  keymgr::Descriptor log = keymgr::OpenRegular(
+      path, startsLog ? O_WRONLY | O_CREAT | O_TRUNC : O_RDWR | O_CREAT | O_APPEND, nullptr,
+      keymgr::Look::kOwnName);
   if (!log) {
+    (void)keymgr::ErrnoFailure("open");
     DebugPrint("file[%s] open error!!\n", path);
     return;
   }
   if (code <= kLastStatusCode) {
     const StatusLine& line = kStatusLines[code];
     DebugPrint("%s", line.text);
-    (void)std::fwrite(line.text, 1, line.length, log.get());
+    const auto write = [&](std::size_t done, std::size_t left) {
+      return ::write(log.get(), line.text + done, left);
+    };
+    // The boot script reads the outcome from here only: a line that did not
+    // reach the file is named on request, though its result stays as it was.
+    if (!keymgr::MoveAll(write, line.length)) {
+      (void)keymgr::ErrnoFailure("write");
+    }
   } else {
     DebugPrint("Unknown flag!!\n");
+  }
+  if (::close(log.release()) != 0) {
+    (void)keymgr::ErrnoFailure("close");
   }
 }

@@ -71,7 +71,7 @@ Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   // a failed stat, not the open, is what makes a status failure. Devices and
   // directories have no meaningful contents to hash.
   std::uint64_t size = 0;
-  file.fd = OpenRegular(path, O_RDONLY, &size);
+  file.fd = OpenRegular(path, O_RDONLY, &size, Look::kAfterOpen);
   if (!file.fd) {
     const int error = errno;
     struct stat st;

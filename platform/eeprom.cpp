@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <openssl/crypto.h>
 #include <sys/file.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -71,6 +72,32 @@ Status MoveAt(Io io, const char* call, int fd, Byte* bytes, std::uint32_t length
   return keymgr::MoveAll(step, length) ? Status() : ErrnoFailure(call);
 }
 
+// Whoever can read the image can hold a shared lock on it for as long as it
+// likes: the exclusive lock is waited for this long at most, and then the
+// write fails like any other.
+constexpr long kLockWaitMs = 3000;
+
+long MillisecondsNow() {
+  timespec now{};
+  ::clock_gettime(CLOCK_MONOTONIC, &now);
+  return now.tv_sec * 1000 + now.tv_nsec / 1'000'000;
+}
+
+Status LockImage(int fd) {
+  const long deadline = MillisecondsNow() + kLockWaitMs;
+  while (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    if (errno != EWOULDBLOCK && errno != EINTR) {
+      return ErrnoFailure("flock");
+    }
+    if (MillisecondsNow() >= deadline) {
+      return ErrnoFailure("flock", ETIMEDOUT);
+    }
+    const timespec pause{0, 10'000'000};
+    ::nanosleep(&pause, nullptr);
+  }
+  return Status();
+}
+
 Status ReadImage(int device, std::uint32_t offset, std::uint32_t length, void* dst) {
   if (Status status = CheckRequest(device, length, dst); !status.ok()) {
     return status;
@@ -112,9 +139,9 @@ Status WriteImage(int device, std::uint32_t offset, std::uint32_t length, const 
     return status;
   }
   // The lock is released when the descriptor closes.
-  while (lock && ::flock(image.fd.get(), LOCK_EX) != 0) {
-    if (errno != EINTR) {
-      return ErrnoFailure("flock");
+  if (lock) {
+    if (Status status = LockImage(image.fd.get()); !status.ok()) {
+      return status;
     }
   }
   if (!InRange(offset, length, 0, image.size)) {

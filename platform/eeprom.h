@@ -20,7 +20,8 @@ EEPROM_NODISCARD int ReadEEPROM_msok(int device, uint32_t offset, uint32_t lengt
 EEPROM_NODISCARD int WriteSectionEEPROM(int device, uint32_t offset, uint32_t length,
                                         const void* src, uint32_t sectionStart,
                                         uint32_t sectionLength);
-// WriteEEPROM_Bytes_Sema holds an exclusive lock on the image while it writes.
+// WriteEEPROM_Bytes_Sema holds an exclusive lock on the image while it
+// writes. It waits for the lock three seconds at most, then fails.
 EEPROM_NODISCARD int WriteEEPROM_Bytes_Sema(int device, uint32_t offset, uint32_t length,
                                             const void* src);
 

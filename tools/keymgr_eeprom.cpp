@@ -62,7 +62,9 @@ int Init() {
   // taking the blank bytes.
   const keymgr::Descriptor image =
       keymgr::OpenRegular(keymgr::kEepromPath, O_WRONLY | O_CREAT | O_TRUNC);
-  if (!image) {
+  // Only its owner may read it: a reader can hold a lock that holds up the
+  // module's writes, and the image holds the sealed store key.
+  if (!image || ::fchmod(image.get(), 0600) != 0) {
     return Fail("cannot create the EEPROM image");
   }
   const int fd = image.get();

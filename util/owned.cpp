@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 namespace keymgr {
@@ -21,18 +22,47 @@ Descriptor Failed(Descriptor& fd, int error) {
   return Descriptor();
 }
 
-// OpenWithoutBlocking opens |path| with O_NONBLOCK, so that a FIFO with no
-// peer fails or opens at once instead of waiting for one. A file that O_CREAT
-// would create is created only where nothing stands: O_EXCL refuses a
+// Create makes the file at |path| where nothing stands: O_EXCL refuses a
 // dangling symbolic link rather than create the file it points to.
-int OpenWithoutBlocking(const char* path, int flags) {
-  flags |= O_NONBLOCK | O_CLOEXEC;
-  if ((flags & O_CREAT) == 0) {
-    return ::open(path, flags);
+Descriptor Create(const char* path, int flags) {
+  return Descriptor(::open(path, (flags & ~O_TRUNC) | O_EXCL | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
+                           kNewFileMode));
+}
+
+// KindError is the errno of a file that is not regular, or not |look|'s own.
+int KindError(const struct stat& st, Look look) {
+  if (S_ISDIR(st.st_mode)) {
+    return EISDIR;
   }
-  int fd = ::open(path, flags & ~O_CREAT);
-  if (fd < 0 && errno == ENOENT) {
-    fd = ::open(path, flags | O_EXCL, kNewFileMode);
+  if (S_ISLNK(st.st_mode) || (look == Look::kOwnName && st.st_nlink != 1)) {
+    return ELOOP;
+  }
+  return S_ISREG(st.st_mode) ? 0 : EINVAL;
+}
+
+// OpenLooked opens |path| after looking at what it names, and sets |looked|
+// to that (left zero when it creates the file). It opens the file that the
+// look found, through /proc, whatever |path| names by now; without /proc
+// (early in boot) it opens the path once more, and the caller must check
+// that the file is still the one looked at.
+Descriptor OpenLooked(const char* path, int flags, Look look, struct stat& looked) {
+  const int noFollow = look == Look::kOwnName ? O_NOFOLLOW : 0;
+  Descriptor where(::open(path, O_PATH | O_CLOEXEC | noFollow));
+  if (!where) {
+    return errno == ENOENT && (flags & O_CREAT) != 0 ? Create(path, flags) : Descriptor();
+  }
+  if (::fstat(where.get(), &looked) != 0) {
+    return Failed(where, errno);
+  }
+  if (const int error = KindError(looked, look); error != 0) {
+    return Failed(where, error);
+  }
+  flags = (flags & ~(O_CREAT | O_EXCL | O_TRUNC)) | O_NONBLOCK | O_CLOEXEC;
+  char self[32];
+  (void)std::snprintf(self, sizeof(self), "/proc/self/fd/%d", where.get());
+  Descriptor fd(::open(self, flags));
+  if (!fd && errno == ENOENT) {
+    fd.reset(::open(path, flags | noFollow));
   }
   return fd;
 }
@@ -53,8 +83,11 @@ int FlagsOf(const char* mode) {
 
 }  // namespace
 
-Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size) {
-  Descriptor fd(OpenWithoutBlocking(path, flags & ~O_TRUNC));
+Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size, Look look) {
+  struct stat looked {};
+  Descriptor fd = look == Look::kAfterOpen
+                      ? Descriptor(::open(path, (flags & ~O_TRUNC) | O_NONBLOCK | O_CLOEXEC))
+                      : OpenLooked(path, flags, look, looked);
   if (!fd) {
     return fd;
   }
@@ -62,8 +95,11 @@ Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size) {
   if (::fstat(fd.get(), &st) != 0) {
     return Failed(fd, errno);
   }
-  if (!S_ISREG(st.st_mode)) {
-    return Failed(fd, S_ISDIR(st.st_mode) ? EISDIR : EINVAL);
+  if (looked.st_ino != 0 && (st.st_dev != looked.st_dev || st.st_ino != looked.st_ino)) {
+    return Failed(fd, EINVAL);
+  }
+  if (const int error = KindError(st, look); error != 0) {
+    return Failed(fd, error);
   }
   if ((flags & O_TRUNC) != 0) {
     if (::ftruncate(fd.get(), 0) != 0) {

@@ -59,16 +59,32 @@ inline void CloseDescriptor(int fd) {
 using File = Owned<std::FILE*, CloseStream>;
 using Descriptor = Owned<int, CloseDescriptor, -1>;
 
+// How OpenRegular makes sure that |path| is a regular file.
+enum class Look {
+  // Looked at before it is opened, so that no device, FIFO or folder at a
+  // fixed path is ever opened (opening a watchdog device arms it; a FIFO may
+  // have a reader). Symbolic links are followed.
+  kBeforeOpen,
+  // As kBeforeOpen, and the path itself must be the file, with no other
+  // name: no symbolic link, no hard link. For a file in a folder that other
+  // accounts may write.
+  kOwnName,
+  // Opened without blocking and checked afterwards: two calls fewer, for
+  // runs over many files.
+  kAfterOpen,
+};
+
 // OpenRegular opens |path| with the open(2) |flags| and keeps it only when
-// it is a regular file (symbolic links followed): a FIFO, a folder or a
-// device planted at a fixed path then fails like a file that cannot be
+// it is a regular file: anything else fails like a file that cannot be
 // opened, instead of blocking the boot or feeding it endless bytes. The open
 // itself never blocks and the descriptor is closed on exec. With O_CREAT a
 // missing file is created (mode 0666 less the umask), never through a
 // dangling symbolic link; O_TRUNC empties it only once it is known to be
-// regular. On failure errno tells why: EISDIR for a folder, EINVAL for any
-// other kind of file. |size|, when given, receives the file's size.
-[[nodiscard]] Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size = nullptr);
+// regular. On failure errno tells why: EISDIR for a folder, ELOOP for a link
+// that |look| refuses, EINVAL for any other kind of file. |size|, when given,
+// receives the file's size.
+[[nodiscard]] Descriptor OpenRegular(const char* path, int flags, std::uint64_t* size = nullptr,
+                                     Look look = Look::kBeforeOpen);
 
 // OpenFile is OpenRegular as a stream, with an fopen(3) |mode| ("r", "w" or
 // "a", with "+" and "b" as fopen takes them).

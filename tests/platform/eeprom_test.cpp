@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <thread>
 
 #include "keymgr_build_config.h"
@@ -32,12 +33,21 @@ TEST(EepromTest, SectionBoundsDeviceAndLock) {
   EXPECT_EQ(WriteSectionEEPROM(0, 5112, 8, d.data(), 3072, 2048), 8);
   EXPECT_EQ(t::ReadEepromBytes(5112, 8), d);
 
+  // A reader's lock held on: the write gives up after its wait of a few
+  // seconds. Released within the wait: the write goes through.
   int holder = open(KEYMGR_EEPROM_PATH, O_RDONLY), result = 0;
-  ASSERT_EQ(flock(holder, LOCK_EX), 0);
+  ASSERT_EQ(flock(holder, LOCK_SH), 0);
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_LT(WriteEEPROM_Bytes_Sema(0, 32760, 8, d.data()), 0);
+  const auto waited = std::chrono::steady_clock::now() - start;
+  EXPECT_GE(waited, std::chrono::seconds(2));
+  EXPECT_LT(waited, std::chrono::seconds(5));
   std::thread writer([&] { result = WriteEEPROM_Bytes_Sema(0, 32760, 8, d.data()); });
   usleep(200000);
   EXPECT_EQ(t::ReadEepromBytes(32760, 8), blank);
-  flock(holder, LOCK_UN), close(holder), writer.join();
+  flock(holder, LOCK_UN);
+  close(holder);
+  writer.join();
   EXPECT_EQ(result, 8);
   EXPECT_EQ(t::ReadEepromBytes(32760, 8), d);
 }

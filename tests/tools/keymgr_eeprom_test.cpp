@@ -21,7 +21,7 @@ keymgr::test::RunResult Tool(const std::string& words) {
 
 // Numbers are decimal (a leading zero does not make octal) or 0x-prefixed hex.
 // Errors go to standard error with status 1 and change nothing; the second
-// init blanks the image again.
+// init blanks the image again. The image is private to its owner.
 TEST(KeymgrEepromTest, InitWriteReadAndErrors) {
   keymgr::test::ResetSandbox();
   const char* ok[][2] = {{"init", ""},
@@ -42,6 +42,9 @@ TEST(KeymgrEepromTest, InitWriteReadAndErrors) {
     EXPECT_TRUE(run.out.empty() && !run.err.empty()) << words;
   }
   EXPECT_EQ(keymgr::test::ReadFile(KEYMGR_EEPROM_PATH), std::string(32768, '\xFF'));
+  struct stat st {};  // for its owner alone, whatever the umask
+  ASSERT_EQ(::stat(KEYMGR_EEPROM_PATH, &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
   // A FIFO at the image's path fails at once instead of waiting for a reader.
   ASSERT_EQ(::unlink(KEYMGR_EEPROM_PATH), 0);
   ASSERT_EQ(::mkfifo(KEYMGR_EEPROM_PATH, 0600), 0);
