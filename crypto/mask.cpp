@@ -1,11 +1,11 @@
 #include "crypto/mask.h"
 
-#include <openssl/rand.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <cstring>
 
+#include "util/random.h"
 #include "util/secure.h"
 
 namespace keymgr::crypto {
@@ -71,7 +71,9 @@ void XorMask(const MaskKey& key, std::uint64_t nonce, const std::uint8_t* src, s
 
 MaskKey DrawMaskKey() {
   Secret<16> seed;
-  if (RAND_bytes(seed.data(), static_cast<int>(seed.size())) != 1) {
+  // Never waits for the kernel: a normal boot may run before its pool is
+  // ready, and the mask only keeps plain bytes out of memory.
+  if (!KernelRandom(seed.data(), seed.size(), KernelWait::kNo)) {
     timespec now{};
     timespec mono{};
     clock_gettime(CLOCK_REALTIME, &now);

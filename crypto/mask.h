@@ -24,9 +24,10 @@ std::uint64_t MaskWord(const MaskKey& key, std::uint64_t nonce, std::uint64_t bl
 void XorMask(const MaskKey& key, std::uint64_t nonce, const std::uint8_t* src, std::uint8_t* dst,
              std::uint32_t count);
 
-// DrawMaskKey takes a process key from the OpenSSL generator. Should that
-// ever fail, the clocks, process id and stack address still give a key that
-// keeps plain bytes out of memory; only its unpredictability suffers.
+// DrawMaskKey takes a process key from the kernel, without waiting for its
+// pool. Before the pool is ready (early in boot), the clocks, process id and
+// stack address still give a key that keeps plain bytes out of memory; only
+// its unpredictability suffers.
 MaskKey DrawMaskKey();
 
 }  // namespace keymgr::crypto

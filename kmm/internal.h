@@ -30,9 +30,9 @@ inline constexpr std::uint32_t kTpmKeyBits = 2048;
 static_assert(kSealedKeySize == eeprom::kStoreKeyLength && kDigestSize == eeprom::kScDigestLength);
 
 // The one-off key buffer starts out with this value before the TPM draw
-// overwrites it. A failed draw is not fatal, so the store key is then sealed
-// under this value; unsealing starts from it as well, so that a failed unseal
-// reproduces the same key.
+// overwrites it. It never seals a store key (a regeneration whose draw fails
+// stops); unsealing starts from it, so that a failed unseal gives a key that
+// the digest check rejects.
 inline constexpr std::array<std::uint8_t, kOneOffKeySize> kInitialOneOffKey = {
     0x6B, 0x6D, 0x6D, 0x2E, 0x6F, 0x6F, 0x6B, 0x2E, 0xA5, 0x3C, 0x96, 0x0F, 0x5A, 0xC3, 0x69, 0xF0,
     0x1E, 0xE1, 0x2D, 0xD2, 0x4B, 0xB4, 0x78, 0x87, 0x0F, 0xF0, 0x33, 0xCC, 0x55, 0xAA, 0x00, 0xFF};
@@ -99,9 +99,15 @@ inline void Bind(ProtectedKey* record, std::uint8_t* bytes, std::uint32_t length
 // or 1 after the failing step's lines; nothing already stored is undone.
 [[nodiscard]] int RegenerateKey(KeyContext* context);
 
+// SeedRandomOnce fills the C library generator's state through
+// KmmSeedRandom unless this process has done so already. Returns false when
+// no source of randomness answered.
+[[nodiscard]] bool SeedRandomOnce();
+
 // GenerateSeedKey fills the context's seed key from the local date, the
-// calendar time and eight random() words, and binds seedKeyPK to it. The
-// caller seeds random() if it wants to. Always returns 0.
+// calendar time and eight random() words, and binds seedKeyPK to it. A
+// generator this process has not seeded is seeded first. Returns 0, or 1
+// when no source of randomness answered (nothing is made then).
 [[nodiscard]] int GenerateSeedKey(KeyContext* context);
 
 // GenerateSecretKey hashes the seed key into secretKeyPK (32 bytes) and

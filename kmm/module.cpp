@@ -1,4 +1,6 @@
 // The module entry and its one key context.
+#include <sys/prctl.h>
+
 #include <cstddef>
 #include <cstring>
 
@@ -41,6 +43,11 @@ KeyContext g_keyContext;
 extern "C" KeyContext* KeyManage(int32_t option, int logFlag) {
   // Every entry starts from nothing, even one that is then rejected.
   std::memset(&g_keyContext, 0, sizeof(g_keyContext));
+  // From here until the process ends it holds key material: the flow's, then
+  // the context it returns (masked, but under a key that is in memory too),
+  // and what tpm2-tss frees without wiping. A core dump would carry all of
+  // it, so the kernel writes none.
+  (void)::prctl(PR_SET_DUMPABLE, 0);
   // The flow's TPM calls share one connection, and nothing of the TPM stays
   // held once the entry returns.
   pcp_hold_connection();

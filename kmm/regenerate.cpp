@@ -9,6 +9,7 @@
 #include "kmm/internal.h"
 #include "util/debug_print.h"
 #include "util/secure.h"
+#include "util/status.h"
 
 using namespace keymgr::kmm;
 
@@ -45,6 +46,12 @@ int RegenerateKey(KeyContext* context) {
 }
 
 int GenerateSeedKey(KeyContext* context) {
+  // The random words are only as good as the generator's state: a host that
+  // never filled it would get a key found by searching a day of timestamps.
+  if (!SeedRandomOnce()) {
+    (void)keymgr::Refused("no source of randomness for the seed key");
+    return 1;
+  }
   std::array<char, 12> date{};
   keymgr::Secret<sizeof(KmmSeedKey::seedRandom)> random;
 

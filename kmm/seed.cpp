@@ -2,7 +2,7 @@
 // seed key, and persisting the storage root key.
 #include <kmm/kmm.h>
 #include <stdlib.h>
-#include <sys/random.h>
+#include <unistd.h>
 
 #include <array>
 #include <cstddef>
@@ -10,8 +10,9 @@
 #include <cstring>
 
 #include "crypto/hash.h"
+#include "kmm/internal.h"
 #include "platform/pcp.h"
-#include "util/io.h"
+#include "util/random.h"
 #include "util/secure.h"
 
 namespace {
@@ -23,6 +24,9 @@ constexpr std::size_t kStateWords = 64;
 std::array<std::uint32_t, kStateWords> g_state;
 constexpr std::size_t kDrawSize = (kStateWords - 1) * sizeof(std::uint32_t);
 constexpr std::uint32_t kTpmDraw = 64;
+// The process that filled the state last: a child of fork() starts with its
+// parent's state, which it must not reuse for keys of its own.
+pid_t g_seededBy = 0;
 
 // Expand mixes |count| TPM bytes into all of |state|: block i of it is
 // XORed with SHA-256(i, TPM bytes).
@@ -45,27 +49,33 @@ bool Expand(const std::uint8_t* tpm, std::uint32_t count, keymgr::Secret<kDrawSi
 }  // namespace
 
 extern "C" int KmmSeedRandom(void) {
+  // The TPM first: when it answers, the kernel gives only what its pool has
+  // ready, so that an early boot never waits on it.
+  keymgr::Secret<kTpmDraw> tpm;
+  std::uint32_t drawn = 0;
+  const bool tpmAnswered = pcp_getEntropyBytes(kTpmDraw, tpm.data(), &drawn) == 0 && drawn >= 16;
   keymgr::Secret<kDrawSize> state;
-  const bool fromKernel = keymgr::MoveAll(
-      [&](std::size_t done, std::size_t left) { return ::getrandom(state.data() + done, left, 0); },
-      state.size());
+  const bool fromKernel = keymgr::KernelRandom(
+      state.data(), state.size(), tpmAnswered ? keymgr::KernelWait::kNo : keymgr::KernelWait::kYes);
   if (!fromKernel) {
     state.bytes.fill(0);
   }
-  // One draw from the TPM, in clear on the bus, is expanded over the whole
-  // state and mixed with the kernel's: either source alone keeps the state
+  // The TPM's draw, in clear on the bus, is expanded over the whole state and
+  // mixed with the kernel's: either source alone keeps the state
   // unpredictable, should the other be weak or watched on its bus.
-  keymgr::Secret<kTpmDraw> tpm;
-  std::uint32_t drawn = 0;
-  const bool fromTpm = pcp_getEntropyBytes(kTpmDraw, tpm.data(), &drawn) == 0 && drawn >= 16 &&
-                       Expand(tpm.data(), drawn, state);
+  const bool fromTpm = tpmAnswered && Expand(tpm.data(), drawn, state);
   if (!fromTpm && !fromKernel) {
     return -1;
   }
   ::initstate(1, reinterpret_cast<char*>(g_state.data()), sizeof(g_state));
   std::memcpy(g_state.data() + 1, state.data(), kDrawSize);
   ::setstate(reinterpret_cast<char*>(g_state.data()));
+  g_seededBy = ::getpid();
   return fromTpm ? KMM_ENTROPY_TPM : KMM_ENTROPY_GETRANDOM;
+}
+
+bool SeedRandomOnce() {
+  return g_seededBy == ::getpid() || KmmSeedRandom() >= 0;
 }
 
 extern "C" int KmmPersistSrk(void) {

@@ -122,12 +122,18 @@ int GenerateStoreKey(KeyContext* context) {
     Said(pcp_delete_key(nameDigest.data(), 0) == 0, "delete ID/PWD in TPM.");
   }
 
-  // A failed draw is reported and the buffer keeps what it had.
-  Said(pcp_getRandomBytes(kOneOffKeySize, ook.data()) == 0, "generate one_off_key by TPM.");
-  Said(pcp_getRandomBytes(kTpmSecretSize, identity.data()) == 0, "generate user_name_hex.");
+  // A draw that fails (neither the TPM nor the kernel answered) stops the
+  // regeneration before anything is created: the buffer would still hold the
+  // built-in initial key, or the previous identity, or zeros.
+  if (!Said(pcp_getRandomBytes(kOneOffKeySize, ook.data()) == 0, "generate one_off_key by TPM.") ||
+      !Said(pcp_getRandomBytes(kTpmSecretSize, identity.data()) == 0, "generate user_name_hex.")) {
+    return 1;
+  }
   HexOf(identity, nameHex);
   Md5OfString(nameHex.c_str(), nameDigest.data());
-  Said(pcp_getRandomBytes(kTpmSecretSize, password.data()) == 0, "generate user_pass_hex.");
+  if (!Said(pcp_getRandomBytes(kTpmSecretSize, password.data()) == 0, "generate user_pass_hex.")) {
+    return 1;
+  }
   HexOf(password, passHex);
   Md5OfString(passHex.c_str(), passDigest.data());
 

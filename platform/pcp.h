@@ -21,11 +21,15 @@ extern "C" {
 // pcp_hold_connection makes the calls that follow share one connection, its
 // storage parent and its session, until pcp_release_connection, which
 // flushes and closes all of it: nothing of the TPM stays held afterwards.
+// Once the held connection cannot be opened, or a command on it misses its
+// deadline, the calls that follow fail at once until the release.
 void pcp_hold_connection(void);
 void pcp_release_connection(void);
 
-// pcp_getRandomBytes fills |count| bytes of |dst| from the TPM's generator;
-// on failure |dst| is left as it was.
+// pcp_getRandomBytes fills |count| bytes of |dst| (at most 1024) with the
+// TPM's random bytes mixed with the kernel's (getrandom), or the kernel's
+// alone when the TPM does not answer. Fails, leaving |dst| as it was, only
+// when neither source answers.
 PCP_NODISCARD int pcp_getRandomBytes(uint32_t count, uint8_t* dst);
 
 // pcp_getEntropyBytes draws up to |count| bytes (64 at most) from the TPM's

@@ -16,6 +16,7 @@
 #include "platform/fragment.h"
 #include "platform/pcp.h"
 #include "platform/tpm.h"
+#include "util/random.h"
 #include "util/secure.h"
 
 namespace {
@@ -108,19 +109,17 @@ TPMT_RSA_DECRYPT OaepSha256() {
 // response encrypted) or with none.
 Status GetRandom(Connection& tpm, ESYS_TR session, uint16_t want,
                  SecretOutput<TPM2B_DIGEST>& part) {
-  return Run(
+  Status status = Run(
       tpm, "Esys_GetRandom",
       [&] { return Esys_GetRandom_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE, want); },
       [&] { return Esys_GetRandom_Finish(tpm.ctx(), part.out()); });
+  WipeResponse(tpm);
+  return status;
 }
 
-// Draws land in a wiped staging buffer and reach |dst| only when all |count|
-// bytes are in, so that a failed call leaves |dst| as it was.
+// DrawRandom fills |count| bytes at |dst| (at most kMaxRandom) from the
+// TPM's generator; a failure may leave part of a draw there.
 Status DrawRandom(Connection& tpm, uint32_t count, uint8_t* dst) {
-  Secret<kMaxRandom> drawn;
-  if (dst == nullptr || count > drawn.size()) {
-    return Refused("pcp_getRandomBytes");
-  }
   // The draws become keys and passwords: the response is encrypted.
   if (Status status = UseSaltedSession(tpm, TPMA_SESSION_ENCRYPT); !status.ok()) {
     return status;
@@ -136,10 +135,9 @@ Status DrawRandom(Connection& tpm, uint32_t count, uint8_t* dst) {
     if (take == 0) {
       return Refused("Esys_GetRandom");
     }
-    std::memcpy(drawn.data() + filled, part.get()->buffer, take);
+    std::memcpy(dst + filled, part.get()->buffer, take);
     filled += take;
   }
-  std::memcpy(dst, drawn.data(), count);
   return Status();
 }
 
@@ -378,6 +376,7 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
       !status.ok()) {
     return status;
   }
+  WipeResponse(tpm);
   // The TPM ended the session with the command, and ESAPI forgot it.
   (void)session.release();
   if (message.get()->size > *outSize || message.get()->size > sizeof(message.get()->buffer)) {
@@ -392,11 +391,19 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
 // needs it.
 bool g_holding = false;
 std::optional<Connection> g_held;
+// Set when the held connection could not be opened or lost its TPM (a
+// command left unanswered past its deadline, a transport that failed).
+// Until the hold ends every call fails at once, so that a TPM that stops
+// answering costs one deadline per held call, not one per command.
+bool g_heldLost = false;
 
 // OnTpm runs |op| on the held connection, or on one of its own that closes
 // when the call ends. SIGPIPE stays blocked while the TPM is used.
 template <class Op>
 int OnTpm(Op op) {
+  if (g_holding && g_heldLost) {
+    return 1;
+  }
   SigpipeBlock sigpipe;
   std::optional<Connection> own;
   std::optional<Connection>& slot = g_holding ? g_held : own;
@@ -404,13 +411,14 @@ int OnTpm(Op op) {
     slot.emplace();
     if (!Connect(*slot).ok()) {
       slot.reset();
+      g_heldLost = g_holding;
       return 1;
     }
   }
   const Status status = op(*slot);
-  // A connection that lost its TPM is given up; the next call opens another.
   if (slot->broken) {
     slot.reset();
+    g_heldLost = g_holding;
   }
   return status.ok() ? 0 : 1;
 }
@@ -419,19 +427,41 @@ int OnTpm(Op op) {
 
 void pcp_hold_connection(void) {
   g_holding = true;
+  g_heldLost = false;
 }
 
 void pcp_release_connection(void) {
   SigpipeBlock sigpipe;
   g_held.reset();
   g_holding = false;
+  g_heldLost = false;
 }
 
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
   if (count == 0) {
     return 0;
   }
-  return OnTpm([&](Connection& tpm) { return DrawRandom(tpm, count, dst); });
+  if (dst == nullptr || count > kMaxRandom) {
+    return 1;
+  }
+  // The TPM's bytes are mixed with the kernel's, and either serves alone when
+  // the other cannot be had: a TPM that fails or falls silent never leaves a
+  // key at a fixed value, and one whose generator is weak gives nothing away.
+  // The kernel is waited for only when the TPM did not answer.
+  Secret<kMaxRandom> fromTpm;
+  Secret<kMaxRandom> fromKernel;
+  const bool tpmAnswered =
+      OnTpm([&](Connection& tpm) { return DrawRandom(tpm, count, fromTpm.data()); }) == 0;
+  const bool kernelAnswered = keymgr::KernelRandom(
+      fromKernel.data(), count, tpmAnswered ? keymgr::KernelWait::kNo : keymgr::KernelWait::kYes);
+  if (!tpmAnswered && !kernelAnswered) {
+    return 1;
+  }
+  for (uint32_t i = 0; i < count; ++i) {
+    dst[i] =
+        static_cast<uint8_t>((tpmAnswered ? fromTpm[i] : 0) ^ (kernelAnswered ? fromKernel[i] : 0));
+  }
+  return 0;
 }
 
 int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn) {

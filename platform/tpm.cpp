@@ -12,8 +12,10 @@
 #include <string_view>
 
 #include "crypto/hash.h"
+#include "keymgr_build_config.h"
 #include "platform/pcp_tcti.h"
 #include "platform/socket_tcti.h"
+#include "util/random.h"
 
 namespace keymgr::tpm {
 
@@ -28,8 +30,10 @@ using Clock = std::chrono::steady_clock;
 // Each tpm2-tss module reads TSS2_LOG the first time it logs, so setting it
 // before the first ESAPI call is enough; a TSS2_LOG the user has set is kept
 // (no overwrite), so the log can still be had when chasing a fault.
+// A build that keeps key bytes off the console overrides the user's
+// TSS2_LOG too: tpm2-tss's trace shows session keys and auth values.
 void QuietTssLog() {
-  setenv("TSS2_LOG", "all+none", 0);
+  setenv("TSS2_LOG", "all+none", KEYMGR_REDACT_OOK);
 }
 
 bool IsTransportFailure(TSS2_RC rc) {
@@ -207,7 +211,10 @@ void FinalizeEsys(ESYS_CONTEXT* esys) {
 }
 
 void FlushObject(EsysObject object) {
-  (void)Check("Esys_FlushContext", Esys_FlushContext(object.esys, object.tr));
+  Connection& tpm = *object.tpm;
+  (void)Run(
+      tpm, "Esys_FlushContext", [&] { return Esys_FlushContext_Async(tpm.ctx(), object.tr); },
+      [&] { return Esys_FlushContext_Finish(tpm.ctx()); });
 }
 
 void CloseObject(EsysObject object) {
@@ -215,8 +222,17 @@ void CloseObject(EsysObject object) {
   // overwrite it first.
   TPM2B_AUTH blank{};
   blank.size = 16;
-  (void)Check("Esys_TR_SetAuth", Esys_TR_SetAuth(object.esys, object.tr, &blank));
-  (void)Check("Esys_TR_Close", Esys_TR_Close(object.esys, &object.tr));
+  ESYS_CONTEXT* esys = object.tpm->ctx();
+  (void)Check("Esys_TR_SetAuth", Esys_TR_SetAuth(esys, object.tr, &blank));
+  (void)Check("Esys_TR_Close", Esys_TR_Close(esys, &object.tr));
+}
+
+void WipeResponse(Connection& tpm) {
+  size_t size = 0;
+  const uint8_t* parameters = nullptr;
+  if (Tss2_Sys_GetRpBuffer(tpm.sys, &size, &parameters) == TSS2_RC_SUCCESS) {
+    OPENSSL_cleanse(const_cast<uint8_t*>(parameters), size);
+  }
 }
 
 SigpipeBlock::SigpipeBlock() {
@@ -380,11 +396,25 @@ Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* 
   symmetric.keyBits.aes = 128;
   symmetric.mode.aes = TPM2_ALG_CFB;
   *session = ESYS_TR_NONE;
+  // Left to ESAPI, the nonce would come from OpenSSL's generator, which
+  // waits for the kernel's pool. The TPM's nonce makes the session fresh;
+  // this one need only differ from run to run, which the clock ensures
+  // while the pool is not ready.
+  TPM2B_NONCE nonce{};
+  nonce.size = crypto::kSha256Size;
+  if (!KernelRandom(nonce.buffer, nonce.size, KernelWait::kNo)) {
+    timespec clocks[2]{};
+    clock_gettime(CLOCK_REALTIME, &clocks[0]);
+    clock_gettime(CLOCK_MONOTONIC, &clocks[1]);
+    crypto::Sha256 sha;
+    (void)sha.Update(clocks, sizeof(clocks));
+    (void)sha.Final(std::span<std::uint8_t, crypto::kSha256Size>(nonce.buffer, nonce.size));
+  }
   return Run(
       tpm, "Esys_StartAuthSession",
       [&] {
         return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE, nullptr, TPM2_SE_HMAC, &symmetric,
+                                           ESYS_TR_NONE, &nonce, TPM2_SE_HMAC, &symmetric,
                                            TPM2_ALG_SHA256);
       },
       [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });

@@ -35,16 +35,20 @@ void FinalizeEsys(ESYS_CONTEXT* esys);
 using TctiContext = Owned<TSS2_TCTI_CONTEXT*, FinalizeTcti>;
 using EsysContext = Owned<ESYS_CONTEXT*, FinalizeEsys>;
 
-// EsysObject is an ESAPI object handle with the context it belongs to.
+struct Connection;
+
+// EsysObject is an ESAPI object handle with the connection it belongs to.
 struct EsysObject {
-  ESYS_CONTEXT* esys = nullptr;
+  Connection* tpm = nullptr;
   ESYS_TR tr = ESYS_TR_NONE;
   bool operator==(const EsysObject&) const = default;
 };
-// FlushObject flushes a transient object or session from the TPM.
+// FlushObject flushes a transient object or session from the TPM, within the
+// command deadline like every other command; on a connection that lost its
+// TPM it sends nothing.
 void FlushObject(EsysObject object);
 // CloseObject forgets a persistent object's auth value and closes its handle;
-// the object stays in the TPM.
+// the object stays in the TPM. It sends no command.
 void CloseObject(EsysObject object);
 using TransientObject = Owned<EsysObject, FlushObject>;
 using PersistentObject = Owned<EsysObject, CloseObject>;
@@ -101,7 +105,7 @@ struct Connection {
   TPM2B_PUBLIC createdPublic{};
 
   ESYS_CONTEXT* ctx() const { return esys.get(); }
-  EsysObject Object(ESYS_TR tr) const { return {esys.get(), tr}; }
+  EsysObject Object(ESYS_TR tr) { return {this, tr}; }
   ESYS_TR Parent() const { return srk ? srk.get().tr : primary.get().tr; }
 };
 
@@ -145,6 +149,10 @@ Status Run(Connection& tpm, const char* call, Send send, Finish finish) {
   return Check(call, rc);
 }
 
+// WipeResponse wipes the parameters of the last response in ESAPI's own
+// buffer, where a response that a session encrypted lies decrypted.
+void WipeResponse(Connection& tpm);
+
 // ReadPublic reads the public area of the object at |handle| and checks it
 // against the name the TPM gives for it.
 Status ReadPublic(Connection& tpm, TPM2_HANDLE handle, TPM2B_PUBLIC* area);
@@ -160,6 +168,8 @@ Status UseParent(Connection& tpm);
 // StartHmacSession starts an HMAC session with AES-128-CFB parameter
 // encryption, salted by |tpmKey| and bound to |bind| (either may be
 // ESYS_TR_NONE), and leaves it in |session|. The caller owns the session.
+// Its nonce comes from the kernel without waiting, so that a boot never
+// waits for the kernel's pool.
 Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session);
 
 // UseSaltedSession makes the connection's HMAC session available, salted by

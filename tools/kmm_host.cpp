@@ -36,8 +36,10 @@ int main(int argc, char** argv) {
     return Usage();
   }
   // A regeneration's seed key comes from random(); without fresh seeding
-  // the secret key could be guessed, so that run does not go ahead.
-  if (KmmSeedRandom() < 0 && args.option == KMM_OPTION_REGENERATE) {
+  // the secret key could be guessed, so that run does not go ahead. A boot
+  // proof draws nothing random and seeds nothing: early in boot it would
+  // wait for the kernel's pool.
+  if (args.option == KMM_OPTION_REGENERATE && KmmSeedRandom() < 0) {
     (void)std::fprintf(stderr, "kmm-host: no random source to seed the key generation\n");
     return 1;
   }

@@ -65,9 +65,12 @@ typedef struct KeyContext {
 /* KeyManage zeroes the module's context and runs |option|:
  * KMM_OPTION_NORMAL_BOOT proves the key material (recording DT=OK/DT=FAIL in
  * the boot status log when |logFlag| is non-zero), KMM_OPTION_REGENERATE
- * replaces it (call KmmSeedRandom first). Returns the context on success and
- * NULL on failure or for any other option. The contents are valid until the
- * next call; the module is not reentrant. */
+ * replaces it (seeding the C library generator first, through KmmSeedRandom,
+ * when this process has not). Returns the context on success and NULL on
+ * failure or for any other option. The contents are valid until the next
+ * call; the module is not reentrant. From the first call on the process holds
+ * key material and is made non-dumpable (PR_SET_DUMPABLE 0): the kernel
+ * writes no core of it. */
 KeyContext* KeyManage(int32_t option, int logFlag);
 
 /* Sources that KmmSeedRandom reports. */
@@ -75,13 +78,15 @@ KeyContext* KeyManage(int32_t option, int logFlag);
 #define KMM_ENTROPY_GETRANDOM 2
 
 /* KmmSeedRandom fills the whole state of the C library generator (random())
- * with fresh random bytes: the kernel's getrandom mixed with the TPM's, or
- * either alone when the other cannot be had. The module never seeds
- * the generator itself and builds the seed key from it: a host that skips
- * this call before KeyManage(KMM_OPTION_REGENERATE, ...) gets a guessable
- * secret key. Returns KMM_ENTROPY_TPM or KMM_ENTROPY_GETRANDOM, the source
- * used, or -1 when neither answered (the generator is then left as it was).
- * It replaces whatever seeding the host did before. */
+ * with fresh random bytes: the TPM's mixed with the kernel's getrandom, or
+ * either alone when the other cannot be had; the kernel is waited for only
+ * when the TPM does not answer. The module builds the seed key from that
+ * generator, and calls this itself before a regeneration in a process that
+ * has not; without any source the regeneration fails. Returns
+ * KMM_ENTROPY_TPM or KMM_ENTROPY_GETRANDOM, the source used, or -1 when
+ * neither answered (the generator is then left as it was). It replaces
+ * whatever seeding the host did before; seeding the host does after it is
+ * what the next seed key is made of. */
 int KmmSeedRandom(void);
 
 /* KmmPersistSrk makes the TPM's standard storage root key persistent at

@@ -104,7 +104,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         eeprom.fault.count = in.ConsumeIntegralInRange(0, 4);
         break;
       case 3:
-        keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0, 2);
+        keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0u, 3u);
         break;
       case 4:
         keyManager.keys[Md5OfHex(kKeyIdPath)] = Md5OfHex(kKeyPwdPath);

@@ -28,7 +28,8 @@ int Transfer(int device, std::uint32_t offset, std::uint32_t length, void* dst, 
     return -22;
   }
   if (fault.count > 0 && offset < fault.end && offset + length > fault.begin) {
-    return --fault.count, -5;
+    --fault.count;
+    return -5;
   }
   std::memcpy(dst, src, length);
   return static_cast<int>(length);
@@ -36,7 +37,8 @@ int Transfer(int device, std::uint32_t offset, std::uint32_t length, void* dst, 
 
 // Fails tells whether this call of |op| is one to fail.
 bool Fails(PcpOp op) {
-  return KeyManager().fail[op]-- > 0;
+  const unsigned call = KeyManager().calls[op]++;
+  return call < 32 && ((KeyManager().fail[op] >> call) & 1) != 0;
 }
 
 }  // namespace

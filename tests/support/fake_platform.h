@@ -29,11 +29,12 @@ struct FakeEeprom {
 
 // FakeKeyManager keeps the TPM's keys as the MD5 of a name mapped to the MD5
 // of its password. A fragment holds its data in the clear; only the key's
-// password opens it. fail[op] fails that many calls of op.
+// password opens it. Bit n of fail[op] fails the (n+1)th call of op.
 enum PcpOp { kRandom, kCreateKey, kEncrypt, kDecrypt };
 struct FakeKeyManager {
   std::map<std::string, std::string> keys;
-  std::array<int, 4> fail{};
+  std::array<unsigned, 4> fail{};
+  std::array<unsigned, 4> calls{};
   void Reset() { *this = {}; }
 };
 

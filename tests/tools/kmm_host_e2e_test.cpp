@@ -1,7 +1,9 @@
 // kmm-host end to end: a real EEPROM image, the real crypto services and the
 // real key manager on the suite's swtpm. Each run is a new process, as at
 // boot.
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -13,6 +15,7 @@
 #include <regex>
 #include <set>
 #include <thread>
+#include <utility>
 
 #include "keymgr_build_config.h"
 #include "platform/eeprom_map.h"
@@ -267,7 +270,6 @@ TEST(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
       {"dangling link", ENOENT, [&](const std::string& p) { fs::create_symlink(gone, p); }},
   };
   const std::string on = "SFE_003 - [4]\n", dtFail = on + "DT=FAIL\nNormal Boot Error!!\n";
-  const std::string log = std::string("file[") + kBootLogPath + "] open error!!\n";
   for (const auto& kind : kinds) {
     const bool folder = kind.error == EISDIR;
     const std::string e = std::to_string(kind.error);
@@ -287,8 +289,6 @@ TEST(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
         {"manifest", kManifestPath, {K}, 1, on + kManifestPath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
         {"digest file", kDigestFilePath, {K}, 1, on + kDigestFilePath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
         {"digest file rebuilt", kDigestFilePath, {K, "hash"}, 0, folder ? kDigestFilePath + std::string(" open error!!!\n") : "", "OLD\n"},
-        {"boot log started", kBootLogPath, {K}, 0, on + log, ""},
-        {"boot log appended", kBootLogPath, {H, "1", "1"}, 0, "Success [HDD]!!\n" + on + log, ""},
         {"EEPROM image", KEYMGR_EEPROM_PATH, {K}, 0, "Read Error [-" + e + "] - SFE CONF from EEPROM !!!\n", "OLD\n"},
         {"EEPROM image written", KEYMGR_EEPROM_PATH, {H, "3"}, 1, "Write error - Message Digest to EEPROM !!!\n", "OLD\n"},
         {"key identity", kKeyIdPath, {H, "1", "1"}, 1, "=\n\nVKT_DTC_AES_Init Failed.\nDecrypt Store Key Error!!\n" + dtFail, "OLD\nDT=FAIL\n"},
@@ -312,9 +312,7 @@ TEST(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
       const RunResult run = test::Run(args);
       EXPECT_EQ(run.status, row.status) << run.out;
       EXPECT_NE(run.out.find(row.out), std::string::npos) << run.out;
-      if (row.path != kBootLogPath) {
-        EXPECT_EQ(ReadFile(kBootLogPath), row.log);
-      }
+      EXPECT_EQ(ReadFile(kBootLogPath), row.log);
       // Replaced, or left as it was; nothing is written through a link.
       const bool writes = row.args.back() == "hash" || row.args.back() == "3";
       EXPECT_EQ(fs::is_regular_file(fs::symlink_status(row.path)),
@@ -330,6 +328,98 @@ TEST(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
       }
     }
   }
+  EvictNew(before);
+}
+
+// The boot status log's folder may be writable by other accounts. A link,
+// another name of a file, or a special file planted at the log's path is
+// never opened for writing (a FIFO not even with a reader waiting), its
+// target is left as it was, and the run ends as with a log that cannot be
+// opened.
+TEST(KmmHostE2e, BootLogIsNeverWrittenThroughALinkOrASpecialFile) {
+  namespace fs = std::filesystem;
+  StartRegenerationTest();  // no key yet: the boot proof fails at once, with its DT line
+  WriteFile(kManifestPath, "");
+  WriteFile(kDigestFilePath, "");
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN, H = KEYMGR_TEST_KMM_HOST_BIN;
+  const std::string target = InRoot("/outside"), trace = InRoot("/trace");
+  int reader = -1;
+  const struct {
+    const char* name;
+    std::function<void()> plant;
+  } kinds[] = {
+      {"link to a file", [&] { fs::create_symlink(target, kBootLogPath); }},
+      {"link to /dev/null", [] { fs::create_symlink("/dev/null", kBootLogPath); }},
+      {"second name of a file", [&] { fs::create_hard_link(target, kBootLogPath); }},
+      {"FIFO with a reader",
+       [&] {
+         mkfifo(kBootLogPath, 0600);
+         reader = open(kBootLogPath, O_RDONLY | O_NONBLOCK);
+       }},
+      {"folder", [] { fs::create_directory(kBootLogPath); }},
+  };
+  const std::string openError = std::string("file[") + kBootLogPath + "] open error!!\n";
+  const std::regex written(
+      R"re((keymgr\.log|outside|/dev/null|/proc/self/fd/\d+)", O_(WRONLY|RDWR)[^=]*= \d)re");
+  for (const auto& kind : kinds) {
+    for (const auto& [program, status] :
+         {std::pair<std::vector<std::string>, int>{{K}, 0}, {{H, "1", "1"}, 1}}) {
+      SCOPED_TRACE(std::string(kind.name) + " for " + program[0]);
+      fs::remove_all(kBootLogPath);
+      WriteFile(target, "another file\n");
+      kind.plant();
+      std::vector<std::string> args = {"strace", "-f", "-qq", "-o", trace, "-e", "trace=%file"};
+      args.insert(args.end(), program.begin(), program.end());
+      const RunResult run = test::Run(args);
+      close(std::exchange(reader, -1));
+      EXPECT_EQ(run.status, status) << run.out;
+      EXPECT_NE(run.out.find(openError), std::string::npos) << run.out;
+      EXPECT_EQ(ReadFile(target), "another file\n");
+      EXPECT_FALSE(std::regex_search(ReadFile(trace).value_or(""), written)) << *ReadFile(trace);
+    }
+  }
+}
+
+// A core of a boot, taken once the one-off key is unsealed or as the program
+// exits, would carry key material: the kernel writes none. The same signal to
+// a run that handles no key leaves a core, so this machine writes them.
+TEST(KmmHostE2e, NoCoreIsWrittenOnceTheModuleHeldKeys) {
+  namespace fs = std::filesystem;
+  StartRegenerationTest();
+  const auto before = NewHandles();
+  ASSERT_EQ(test::Run({KEYMGR_TEST_KMM_HOST_BIN, "3"}).status, 0);
+  // CoreAt signals the program at the first |call| (on |path| if given),
+  // with no limit on the core's size, and returns the core it left.
+  const auto coreAt = [](const std::string& call, const std::string& path,
+                         std::vector<std::string> program) {
+    const std::string dir = InRoot("/core");
+    fs::remove_all(dir);
+    fs::create_directories(dir);
+    std::vector<std::string> args = {"sh",
+                                     "-c",
+                                     R"(cd "$0" && ulimit -c unlimited && exec "$@")",
+                                     dir,
+                                     "strace",
+                                     "-qq",
+                                     "-o",
+                                     "/dev/null",
+                                     "-e",
+                                     "trace=" + call,
+                                     "-e",
+                                     "inject=" + call + ":error=ENOSYS:signal=SIGSEGV"};
+    if (!path.empty()) {
+      args.insert(args.end(), {"-P", path});
+    }
+    program.insert(program.begin(), args.begin(), args.end());
+    test::Run(program);
+    return ReadFile(dir + "/core");
+  };
+  if (!coreAt("exit_group", "", {KEYMGR_TEST_KMM_HOST_BIN, "dmsetup"})) {
+    EvictNew(before);
+    GTEST_SKIP() << "no core lands in the working folder here (core_pattern, sanitizer, emulator)";
+  }
+  EXPECT_FALSE(coreAt("openat", kScDigestPath, {KEYMGR_TEST_KMM_HOST_BIN, "1", "1"}));
+  EXPECT_FALSE(coreAt("exit_group", "", {KEYMGR_TEST_KMM_HOST_BIN, "1", "1"}));
   EvictNew(before);
 }
 
