@@ -4,7 +4,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -40,18 +39,11 @@ std::function<void()> Put(const std::string& path, std::optional<std::string> by
   return [=] { bytes ? t::WriteFile(path, *bytes) : void(fs::remove(path)); };
 }
 
-// EioOn runs |program| with every read of |path| failing with EIO. A
-// sanitizer build's leak check cannot run under ptrace, so it is off there.
+// EioOn runs |program| with every read of |path| failing with EIO.
 std::vector<std::string> EioOn(const std::string& path, const std::string& program) {
-  const char* asan = std::getenv("ASAN_OPTIONS");
-  return {
-      "env",    std::string("ASAN_OPTIONS=") + (asan != nullptr ? asan : "") + ":detect_leaks=0",
-      "strace", "-qq",
-      "-o",     "/dev/null",
-      "-P",     path,
-      "-e",     "trace=read",
-      "-e",     "inject=read:error=EIO",
-      program};
+  return t::Traced(
+      {"-o", "/dev/null", "-P", path, "-e", "trace=read", "-e", "inject=read:error=EIO"},
+      {program});
 }
 
 // Every run starts from a (empty), b, and c, a link to a file whose path has

@@ -101,15 +101,25 @@ RunResult Run(const std::vector<std::string>& argv) {
   return result;
 }
 
-// StraceArgs puts argv under strace with |options|. With seccomp-bpf the
-// program stops only at the traced calls, which keeps long runs fast. -qq
-// keeps the exit of a thread out of the log: printed while another thread is
-// in a traced call, it would split that call's line in two.
+// -qq keeps the exit of a thread out of the log: printed while another
+// thread is in a traced call, it would split that call's line in two.
+std::vector<std::string> Traced(const std::vector<std::string>& options,
+                                const std::vector<std::string>& argv) {
+  const char* asan = std::getenv("ASAN_OPTIONS");
+  std::vector<std::string> args = {
+      "env", std::string("ASAN_OPTIONS=") + (asan != nullptr ? asan : "") + ":detect_leaks=0",
+      "strace", "-qq", "-f"};
+  args.insert(args.end(), options.begin(), options.end());
+  args.insert(args.end(), argv.begin(), argv.end());
+  return args;
+}
+
+// StraceArgs traces with seccomp-bpf: the program stops only at the traced
+// calls, which keeps long runs fast.
 std::vector<std::string> StraceArgs(std::vector<std::string> options,
                                     const std::vector<std::string>& argv) {
-  options.insert(options.begin(), {"strace", "--seccomp-bpf", "-qq", "-f"});
-  options.insert(options.end(), argv.begin(), argv.end());
-  return options;
+  options.insert(options.begin(), "--seccomp-bpf");
+  return Traced(options, argv);
 }
 
 // Ended tells whether process |pid| has ended (gone, or a zombie).

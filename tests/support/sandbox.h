@@ -36,6 +36,11 @@ struct RunResult {
 // Run starts argv[0] with the arguments, stdin on /dev/null, and waits.
 RunResult Run(const std::vector<std::string>& argv);
 
+// Traced puts argv under strace -f with |options|. A sanitizer build's leak
+// check cannot run under ptrace, so it is turned off there.
+std::vector<std::string> Traced(const std::vector<std::string>& options,
+                                const std::vector<std::string>& argv);
+
 // RunKilledAt runs argv, output discarded, and kills it with SIGKILL on entry
 // to its |n|th call of the system call |call|, before that call runs. Returns
 // true when it was killed there, false when it ended first.

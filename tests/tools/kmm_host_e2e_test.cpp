@@ -368,9 +368,7 @@ TEST(KmmHostE2e, BootLogIsNeverWrittenThroughALinkOrASpecialFile) {
       fs::remove_all(kBootLogPath);
       WriteFile(target, "another file\n");
       kind.plant();
-      std::vector<std::string> args = {"strace", "-f", "-qq", "-o", trace, "-e", "trace=%file"};
-      args.insert(args.end(), program.begin(), program.end());
-      const RunResult run = test::Run(args);
+      const RunResult run = test::Run(Traced({"-o", trace, "-e", "trace=%file"}, program));
       close(std::exchange(reader, -1));
       EXPECT_EQ(run.status, status) << run.out;
       EXPECT_NE(run.out.find(openError), std::string::npos) << run.out;
