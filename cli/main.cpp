@@ -10,14 +10,12 @@
 #include "bootlog/boot_status.h"
 #include "cli/command.h"
 #include "integrity/manifest.h"
+#include "keymgr_build_config.h"
 #include "platform/eeprom.h"
 #include "platform/eeprom_map.h"
 #include "util/debug_print.h"
 
 namespace {
-
-constexpr int kVersionMajor = 2;
-constexpr int kVersionMinor = 3;
 
 namespace eeprom = keymgr::eeprom;
 
@@ -51,7 +49,7 @@ int main(int argc, char** argv) {
       VerifyManifestFile(command.path);
       return Finish(0);
     case Action::kVersion:
-      DebugPrint("Version: %d.%d\n", kVersionMajor, kVersionMinor);
+      DebugPrint("Version: %d.%d\n", KEYMGR_VERSION_MAJOR, KEYMGR_VERSION_MINOR);
       return Finish(0);
     case Action::kVerify:
       break;

@@ -8,7 +8,7 @@ install(TARGETS keymgr kmm-host keymgr-eeprom RUNTIME DESTINATION ${CMAKE_INSTAL
 install(TARGETS kmm kmm_shared EXPORT kmmTargets
         ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
         LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
-install(FILES include/kmm/kmm.h DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/kmm)
+install(FILES ${PROJECT_BINARY_DIR}/include/kmm/kmm.h DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/kmm)
 
 set(_kmm_cmakedir ${CMAKE_INSTALL_LIBDIR}/cmake/kmm)
 install(EXPORT kmmTargets NAMESPACE kmm:: DESTINATION ${_kmm_cmakedir})

@@ -31,7 +31,7 @@ for dir in "${!rank[@]}"; do
     fi
   done < <(grep -Hn '^#include "[a-z_]*/' "$dir"/*.h "$dir"/*.cpp 2>/dev/null || true)
 done
-if grep -n '#include' include/kmm/*.h | grep -v '<stdint.h>'; then
+if grep -n '#include' include/kmm/*.h.in | grep -v '<stdint.h>'; then
   echo "include/kmm: the public header includes more than <stdint.h>" >&2
   status=1
 fi
