@@ -51,7 +51,7 @@ Status Ready(FileHasher& hasher) {
   }
   // A hash that cannot run fails like a buffer that cannot be had.
   if (!hasher.buffer || !hasher.context) {
-    return ErrnoFailure("open", ENOMEM);
+    return ErrnoFailure("aligned_alloc", ENOMEM);
   }
   return EVP_DigestInit_ex(hasher.context.get(), EVP_sha256(), nullptr) == 1
              ? Status()
@@ -64,7 +64,7 @@ void FileHasher::FreeBuffer(std::uint8_t* buffer) {
   std::free(buffer);
 }
 
-Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
+HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   // Opened without blocking: a FIFO with no writer would otherwise hold the
   // boot run for ever. Opening first and asking the descriptor for the size
   // walks the path once; only a path that cannot be opened is stat'ed, since
@@ -75,13 +75,14 @@ Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   if (!file.fd) {
     const int error = errno;
     struct stat st;
-    return ::stat(path, &st) < 0 ? ErrnoFailure("stat") : ErrnoFailure("open", error);
+    return ::stat(path, &st) < 0 ? HashResult{HashResult::kStat, ErrnoFailure("stat")}
+                                 : HashResult{HashResult::kOpen, ErrnoFailure("open", error)};
   }
   // The size is a signed 32-bit count: a file of 2 GiB or more fails like an
   // unopenable one rather than wrapping.
   if (size > static_cast<std::uint64_t>(std::numeric_limits<std::int32_t>::max())) {
     file.fd.reset();
-    return ErrnoFailure("open", EFBIG);
+    return {HashResult::kOpen, ErrnoFailure("fstat", EFBIG)};
   }
   file.size = static_cast<std::size_t>(size);
   if (soon && file.size > 0) {
@@ -89,7 +90,7 @@ Status OpenFileToHash(const char* path, FileToHash& file, bool soon) {
     (void)::posix_fadvise(file.fd.get(), 0, static_cast<off_t>(std::min(file.size, kSoonBytes)),
                           POSIX_FADV_WILLNEED);
   }
-  return Status();
+  return {};
 }
 
 Status HashOpenFile(FileHasher& hasher, FileToHash& file,
@@ -108,7 +109,7 @@ Status HashOpenFile(FileHasher& hasher, FileToHash& file,
   bool ended = false;
   while (left > 0) {
     if (stop != nullptr && stop->load(std::memory_order_relaxed)) {
-      return ErrnoFailure("open", ECANCELED);
+      return ErrnoFailure("read", ECANCELED);
     }
     const std::size_t want = std::min(left, kFileReadChunk);
     const std::size_t got = ended ? 0 : ReadUpTo(fd.get(), buffer, want);
@@ -130,13 +131,14 @@ Status HashOpenFile(FileHasher& hasher, FileToHash& file,
   return Status();
 }
 
-Status ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest) {
+HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest) {
   FileToHash file;
-  if (Status status = OpenFileToHash(path, file, false); !status.ok()) {
-    return status;
+  if (HashResult opened = OpenFileToHash(path, file, false); !opened.ok()) {
+    return opened;
   }
   FileHasher hasher;
-  return HashOpenFile(hasher, file, digest, nullptr);
+  Status status = HashOpenFile(hasher, file, digest, nullptr);
+  return {status.ok() ? HashResult::kNone : HashResult::kOpen, status};
 }
 
 }  // namespace keymgr

@@ -35,25 +35,38 @@ struct FileToHash {
   std::size_t size = 0;
 };
 
-// OpenFileToHash opens |path| for HashOpenFile without blocking, and only a
-// regular file below 2 GiB. It fails on "stat" when the path cannot be
-// examined; every other failure (cannot open, not a regular file, too large)
-// counts as an open failure. |soon| tells the kernel that the file will be
-// read shortly, so that it can start reading it in now.
-Status OpenFileToHash(const char* path, FileToHash& file, bool soon);
+// What kept a file from being hashed, which decides the line a caller
+// prints; |status| names the call that failed and its code.
+struct HashResult {
+  enum Failure : std::uint8_t {
+    kNone,
+    kStat,  // the path cannot be examined
+    kOpen,  // the file cannot be opened or read, or is no regular file below 2 GiB
+  };
+  Failure failure = kNone;
+  Status status;
+  bool ok() const { return failure == kNone; }
+};
 
-// HashOpenFile hashes |file| with SHA-256 into |digest| and closes it. The
+// OpenFileToHash opens |path| for HashOpenFile without blocking, and only a
+// regular file below 2 GiB. |soon| tells the kernel that the file will be
+// read shortly, so that it can start reading it in now.
+HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon);
+
+// HashOpenFile hashes |file| with SHA-256 into |digest| and closes it; a
+// failure counts as the file's open failure. The
 // file streams through |hasher|'s buffer, so memory does not grow with the
 // file. Exactly the size that stat gave is hashed: bytes missing because the
 // file shrank count as zeros, bytes added since are not hashed. On failure
 // |digest| is left as it was. When |stop| becomes true the file is abandoned
-// part way (an open failure, ECANCELED), so that a run that has already
+// part way (ECANCELED), so that a run that has already
 // failed does not wait for it.
 Status HashOpenFile(FileHasher& hasher, FileToHash& file,
                     std::span<std::uint8_t, kFileDigestSize> digest, const std::atomic<bool>* stop);
 
 // ComputeFileDigest opens and hashes the file at |path| with a hasher of its
-// own: the digest of a single file, failing as OpenFileToHash does.
-Status ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest);
+// own: the digest of a single file. A file that cannot be hashed once opened
+// fails as one that cannot be opened.
+HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest);
 
 }  // namespace keymgr

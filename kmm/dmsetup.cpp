@@ -21,11 +21,13 @@ int CheckDmsetupDigest(void) {
   FetchConstant(DTC_CONST_DMSETUP_DIGEST, &expected, &expectedLength);
 
   keymgr::Secret<keymgr::kFileDigestSize> digest;
-  if (const keymgr::Status status = keymgr::ComputeFileDigest(keymgr::kDmsetupPath, digest.bytes);
-      !status.ok()) {
+  if (const keymgr::HashResult hashed =
+          keymgr::ComputeFileDigest(keymgr::kDmsetupPath, digest.bytes);
+      !hashed.ok()) {
     // The messages carry errno, which the failure keeps as its code.
-    std::printf(status.Is("stat") ? "file[%s] status error : %d\n" : "file[%s] open error : %d\n",
-                keymgr::kDmsetupPath, static_cast<int>(status.code()));
+    std::printf(hashed.failure == keymgr::HashResult::kStat ? "file[%s] status error : %d\n"
+                                                            : "file[%s] open error : %d\n",
+                keymgr::kDmsetupPath, static_cast<int>(hashed.status.code()));
     return -1;
   }
 

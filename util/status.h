@@ -4,7 +4,6 @@
 
 #include <cerrno>
 #include <cstdint>
-#include <string_view>
 
 namespace keymgr {
 
@@ -29,8 +28,6 @@ class [[nodiscard]] Status {
   constexpr Origin origin() const { return origin_; }
   constexpr std::uint32_t code() const { return code_; }
   constexpr const char* call() const { return call_; }
-  // Is tells whether the failure is of call |name|.
-  bool Is(std::string_view name) const { return !ok() && name == call_; }
 
   static Status Failure(Origin origin, const char* call, std::uint32_t code,
                         const char* text = nullptr);
