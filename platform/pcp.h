@@ -72,6 +72,14 @@ PCP_NODISCARD int pcp_decryptDataFragment(const char* nameHex, const char* passH
                                           const uint8_t* fragment, uint32_t length, uint8_t* out,
                                           uint32_t* outSize);
 
+// pcp_set_transport_for_testing makes the calls that follow open their
+// connections on |tcti| (a tpm2-tss TCTI configuration; "swtpm:" takes this
+// key manager's own transport) with a deadline of |deadlineMs| on every
+// command, in place of the build's KEYMGR_TCTI and KEYMGR_TPM_TIMEOUT_MS. A
+// null |tcti| restores those. For tests: a device uses what it was built
+// with. A connection already held keeps its transport.
+void pcp_set_transport_for_testing(const char* tcti, int deadlineMs);
+
 // pcp_persist_srk makes the standard storage root key persistent at
 // 0x81000001, or finds it there; keys are then created under it without
 // creating a primary each time.

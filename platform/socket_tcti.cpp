@@ -16,7 +16,6 @@
 #include <new>
 #include <string_view>
 
-#include "platform/pcp_tcti.h"
 #include "util/owned.h"
 
 namespace keymgr::tpm {
@@ -34,6 +33,7 @@ struct SocketTcti {
   std::array<char, 108> path{};        // a unix socket, or
   std::array<char, 64> host{};         // a TCP host and port
   std::array<char, 8> port{};
+  int deadlineMs = 0;
   Descriptor socket;
   bool receiving = false;
   std::size_t have = 0;  // bytes of the response read so far
@@ -118,7 +118,7 @@ TSS2_RC Transmit(TSS2_TCTI_CONTEXT* context, size_t size, const uint8_t* command
     return TSS2_TCTI_RC_BAD_REFERENCE;
   }
   // The simulator takes one command per connection.
-  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(kPcpDeadlineMs);
+  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(tcti->deadlineMs);
   tcti->socket.reset();
   tcti->receiving = false;
   if (!Connect(*tcti, deadline)) {
@@ -159,9 +159,8 @@ TSS2_RC Receive(TSS2_TCTI_CONTEXT* context, size_t* size, uint8_t* response, int
   if (!tcti->receiving) {
     return TSS2_TCTI_RC_BAD_SEQUENCE;
   }
-  const Clock::time_point deadline = timeout < 0
-                                         ? Clock::now() + std::chrono::milliseconds(kPcpDeadlineMs)
-                                         : Clock::now() + std::chrono::milliseconds(timeout);
+  const Clock::time_point deadline =
+      Clock::now() + std::chrono::milliseconds(timeout < 0 ? tcti->deadlineMs : timeout);
   // A partial answer stays here for the next call after TRY_AGAIN.
   while (tcti->have < ResponseSize(*tcti)) {
     const std::size_t want = ResponseSize(*tcti);
@@ -243,7 +242,7 @@ bool Parse(std::string_view conf, SocketTcti& tcti) {
 
 }  // namespace
 
-Status InitSocketTcti(const char* conf, TSS2_TCTI_CONTEXT** tcti) {
+Status InitSocketTcti(const char* conf, int deadlineMs, TSS2_TCTI_CONTEXT** tcti) {
   auto* context = new (std::nothrow) SocketTcti;
   if (context == nullptr) {
     return ErrnoFailure("socket TCTI", ENOMEM);
@@ -252,6 +251,7 @@ Status InitSocketTcti(const char* conf, TSS2_TCTI_CONTEXT** tcti) {
     delete context;
     return Refused("socket TCTI configuration");
   }
+  context->deadlineMs = deadlineMs;
   TSS2_TCTI_CONTEXT_COMMON_V1& v1 = context->common.v1;
   v1.magic = kMagic;
   v1.version = 2;

@@ -14,8 +14,9 @@
 namespace keymgr::tpm {
 
 // InitSocketTcti makes a TCTI for |conf| ("path=SOCKET", or
-// "host=HOST,port=PORT" for TCP), sending nothing yet.
-Status InitSocketTcti(const char* conf, TSS2_TCTI_CONTEXT** tcti);
+// "host=HOST,port=PORT" for TCP) whose connects, sends and receives each
+// take |deadlineMs| at most, sending nothing yet.
+Status InitSocketTcti(const char* conf, int deadlineMs, TSS2_TCTI_CONTEXT** tcti);
 
 // IsSocketTcti tells whether |tcti| was made by InitSocketTcti;
 // FinalizeSocketTcti closes and frees such a TCTI.

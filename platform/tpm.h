@@ -89,6 +89,11 @@ class SigpipeBlock {
 // Its members go in reverse order: the session and the parent are flushed or
 // closed before ESAPI and then the transport are finalised.
 struct Connection {
+  // The TCTI configuration and the deadline of each command, in
+  // milliseconds: the build's (KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS) unless a
+  // test set others.
+  const char* transport = nullptr;
+  int deadlineMs = 0;
   TctiContext tcti;
   EsysContext esys;
   TSS2_SYS_CONTEXT* sys = nullptr;  // ESAPI's own, for the raw commands
@@ -114,14 +119,18 @@ struct Connection {
 // connection and flushes what it leaves behind.
 bool HasResourceManager(const char* tcti);
 
-// Connect opens the build's transport and ESAPI on it. It sends nothing: a
-// TPM that still needs TPM2_Startup gets it with the first command.
+// SetTransport makes the connections opened from now on use |tcti| and a
+// command deadline of |deadlineMs|; a null |tcti| restores the build's.
+void SetTransport(const char* tcti, int deadlineMs);
+
+// Connect opens the transport and ESAPI on it. It sends nothing: a TPM that
+// still needs TPM2_Startup gets it with the first command.
 Status Connect(Connection& tpm);
 
 // Run sends one command and names its failure |call|. |send| starts the
 // command (an ESAPI _Async call, or a raw command's preparation and send) and
 // |finish| collects the answer, waiting at most tpm.waitMs; the command fails
-// at the deadline. A TPM that was not started is started and the command
+// at the connection's deadline. A TPM that was not started is started and the command
 // sent again; without a resource manager, a TPM whose slots are full of what
 // a dead process left is cleared and the command sent again.
 template <class Send, class Finish>

@@ -1,3 +1,5 @@
+// The TPM connection: opening it, sending each command within the deadline,
+// and recovering from a TPM that was not started or is full.
 #include "platform/tpm.h"
 
 #include <pthread.h>
@@ -7,13 +9,13 @@
 
 #include <algorithm>
 #include <array>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <string_view>
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
-#include "platform/pcp_tcti.h"
 #include "platform/socket_tcti.h"
 #include "util/random.h"
 
@@ -22,6 +24,12 @@ namespace keymgr::tpm {
 namespace {
 
 using Clock = std::chrono::steady_clock;
+
+// The transport that connections opened from now on take: the build's, or a
+// copy of the one a test set.
+const char* g_tcti = KEYMGR_TCTI;
+std::array<char, 256> g_testTcti{};
+int g_deadlineMs = KEYMGR_TPM_TIMEOUT_MS;
 
 // tpm2-tss writes an error line to stderr for every failed command, the
 // expected ones here included (a wrong password, a missing key, a taken
@@ -111,87 +119,6 @@ void FlushLeftovers(Connection& tpm) {
   }
 }
 
-// The storage template of TCG's provisioning guidance: ECC P-256, AES-128
-// CFB, no policy, an all-zero unique field. Created with it, the primary is
-// the same key as the persistent SRK.
-TPM2B_PUBLIC SrkTemplate() {
-  TPM2B_PUBLIC templ{};
-  TPMT_PUBLIC& area = templ.publicArea;
-  area.type = TPM2_ALG_ECC;
-  area.nameAlg = TPM2_ALG_SHA256;
-  area.objectAttributes = TPMA_OBJECT_RESTRICTED | TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
-                          TPMA_OBJECT_FIXEDPARENT | TPMA_OBJECT_SENSITIVEDATAORIGIN |
-                          TPMA_OBJECT_USERWITHAUTH | TPMA_OBJECT_NODA;
-  TPMS_ECC_PARMS& ecc = area.parameters.eccDetail;
-  ecc.symmetric.algorithm = TPM2_ALG_AES;
-  ecc.symmetric.keyBits.aes = 128;
-  ecc.symmetric.mode.aes = TPM2_ALG_CFB;
-  ecc.scheme.scheme = TPM2_ALG_NULL;
-  ecc.curveID = TPM2_ECC_NIST_P256;
-  ecc.kdf.scheme = TPM2_ALG_NULL;
-  area.unique.ecc.x.size = 32;
-  area.unique.ecc.y.size = 32;
-  return templ;
-}
-
-// IsStandardSrk tells whether |area| was made from the storage template.
-bool IsStandardSrk(const TPMT_PUBLIC& area) {
-  const TPMT_PUBLIC expected = SrkTemplate().publicArea;
-  const TPMS_ECC_PARMS& ecc = area.parameters.eccDetail;
-  const TPMS_ECC_PARMS& want = expected.parameters.eccDetail;
-  return area.type == expected.type && area.nameAlg == expected.nameAlg &&
-         area.objectAttributes == expected.objectAttributes && area.authPolicy.size == 0 &&
-         ecc.symmetric.algorithm == want.symmetric.algorithm &&
-         ecc.symmetric.keyBits.aes == want.symmetric.keyBits.aes &&
-         ecc.symmetric.mode.aes == want.symmetric.mode.aes &&
-         ecc.scheme.scheme == want.scheme.scheme && ecc.curveID == want.curveID &&
-         ecc.kdf.scheme == want.kdf.scheme;
-}
-
-Status CreatePrimary(Connection& tpm) {
-  TPM2B_SENSITIVE_CREATE sensitive{};
-  const TPM2B_PUBLIC templ = SrkTemplate();
-  TPM2B_DATA outsideInfo{};
-  TPML_PCR_SELECTION pcrs{};
-  ESYS_TR primary = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_CreatePrimary",
-      [&] {
-        return Esys_CreatePrimary_Async(tpm.ctx(), ESYS_TR_RH_OWNER, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                                        ESYS_TR_NONE, &sensitive, &templ, &outsideInfo, &pcrs);
-      },
-      [&] {
-        return Esys_CreatePrimary_Finish(tpm.ctx(), &primary, nullptr, nullptr, nullptr, nullptr);
-      });
-  if (status.ok()) {
-    tpm.primary.reset(tpm.Object(primary));
-  }
-  return status;
-}
-
-// OpenSrk finds the standard SRK at kSrkHandle, when it is there.
-Status OpenSrk(Connection& tpm) {
-  TPM2B_PUBLIC area{};
-  if (Status status = ReadPublic(tpm, kSrkHandle, &area); !status.ok()) {
-    return status;
-  }
-  if (!IsStandardSrk(area.publicArea)) {
-    return Refused("not the standard SRK");
-  }
-  ESYS_TR srk = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_TR_FromTPMPublic",
-      [&] {
-        return Esys_TR_FromTPMPublic_Async(tpm.ctx(), kSrkHandle, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE);
-      },
-      [&] { return Esys_TR_FromTPMPublic_Finish(tpm.ctx(), &srk); });
-  if (status.ok()) {
-    tpm.srk.reset(tpm.Object(srk));
-  }
-  return status;
-}
-
 }  // namespace
 
 Status TssFailure(const char* call, TSS2_RC rc) {
@@ -262,15 +189,29 @@ bool HasResourceManager(const char* tcti) {
   return std::strncmp(tcti, "device:/dev/tpmrm", 17) == 0 || std::strncmp(tcti, "tabrmd", 6) == 0;
 }
 
+void SetTransport(const char* tcti, int deadlineMs) {
+  g_tcti = KEYMGR_TCTI;
+  g_deadlineMs = KEYMGR_TPM_TIMEOUT_MS;
+  if (tcti != nullptr) {
+    // One that does not fit is cut short, and then names no transport.
+    (void)std::snprintf(g_testTcti.data(), g_testTcti.size(), "%s", tcti);
+    g_tcti = g_testTcti.data();
+    g_deadlineMs = deadlineMs;
+  }
+}
+
 Status Connect(Connection& tpm) {
   QuietTssLog();
+  tpm.transport = g_tcti;
+  tpm.deadlineMs = g_deadlineMs;
   // A simulator's socket gets the transport with deadlines; every other
   // transport is tpm2-tss's.
-  const std::string_view tcti = kPcpTcti;
-  const Status opened =
-      tcti == "swtpm" || tcti.starts_with("swtpm:")
-          ? InitSocketTcti(kPcpTcti + std::min<std::size_t>(tcti.size(), 6), tpm.tcti.out())
-          : Check("Tss2_TctiLdr_Initialize", Tss2_TctiLdr_Initialize(kPcpTcti, tpm.tcti.out()));
+  const std::string_view tcti = tpm.transport;
+  const Status opened = tcti == "swtpm" || tcti.starts_with("swtpm:")
+                            ? InitSocketTcti(tpm.transport + std::min<std::size_t>(tcti.size(), 6),
+                                             tpm.deadlineMs, tpm.tcti.out())
+                            : Check("Tss2_TctiLdr_Initialize",
+                                    Tss2_TctiLdr_Initialize(tpm.transport, tpm.tcti.out()));
   if (!opened.ok()) {
     return opened;
   }
@@ -287,7 +228,7 @@ TSS2_RC SendOnce(Connection& tpm, TSS2_RC (*send)(void*), TSS2_RC (*finish)(void
     return TSS2_ESYS_RC_BAD_SEQUENCE;
   }
   TSS2_RC rc = send(call);
-  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(kPcpDeadlineMs);
+  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(tpm.deadlineMs);
   while (rc == TSS2_RC_SUCCESS) {
     const auto left =
         std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now());
@@ -323,7 +264,7 @@ bool Recover(Connection& tpm, TSS2_RC rc) {
     // "Already started" means another caller got there first.
     return started == TSS2_RC_SUCCESS || started == TPM2_RC_INITIALIZE;
   }
-  if (IsFull(rc) && !HasResourceManager(kPcpTcti)) {
+  if (IsFull(rc) && !HasResourceManager(tpm.transport)) {
     FlushLeftovers(tpm);
     return true;
   }
@@ -376,87 +317,6 @@ Status EvictPersistent(Connection& tpm, TPM2_HANDLE handle) {
     return status;
   }
   return Check("Tss2_Sys_EvictControl_Complete", Tss2_Sys_EvictControl_Complete(tpm.sys));
-}
-
-Status UseParent(Connection& tpm) {
-  if (tpm.primary || tpm.srk) {
-    return Status();
-  }
-  // Without the SRK, or with something else at its handle, the same key is
-  // made from the template.
-  if (OpenSrk(tpm).ok()) {
-    return Status();
-  }
-  return tpm.broken ? Refused("TPM connection lost") : CreatePrimary(tpm);
-}
-
-Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session) {
-  TPMT_SYM_DEF symmetric{};
-  symmetric.algorithm = TPM2_ALG_AES;
-  symmetric.keyBits.aes = 128;
-  symmetric.mode.aes = TPM2_ALG_CFB;
-  *session = ESYS_TR_NONE;
-  // Left to ESAPI, the nonce would come from OpenSSL's generator, which
-  // waits for the kernel's pool. The TPM's nonce makes the session fresh;
-  // this one need only differ from run to run, which the clock ensures
-  // while the pool is not ready.
-  TPM2B_NONCE nonce{};
-  nonce.size = crypto::kSha256Size;
-  if (!KernelRandom(nonce.buffer, nonce.size, KernelWait::kNo)) {
-    timespec clocks[2]{};
-    clock_gettime(CLOCK_REALTIME, &clocks[0]);
-    clock_gettime(CLOCK_MONOTONIC, &clocks[1]);
-    crypto::Sha256 sha;
-    (void)sha.Update(clocks, sizeof(clocks));
-    (void)sha.Final(std::span<std::uint8_t, crypto::kSha256Size>(nonce.buffer, nonce.size));
-  }
-  return Run(
-      tpm, "Esys_StartAuthSession",
-      [&] {
-        return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE, &nonce, TPM2_SE_HMAC, &symmetric,
-                                           TPM2_ALG_SHA256);
-      },
-      [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });
-}
-
-Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes) {
-  if (!tpm.session) {
-    if (Status status = UseParent(tpm); !status.ok()) {
-      return status;
-    }
-    ESYS_TR session = ESYS_TR_NONE;
-    if (Status status = StartHmacSession(tpm, tpm.Parent(), ESYS_TR_NONE, &session); !status.ok()) {
-      return status;
-    }
-    tpm.session.reset(tpm.Object(session));
-  }
-  // The session stays loaded after each command, so that it is flushed with
-  // the connection on every path, failed commands included.
-  return Check("Esys_TRSess_SetAttributes",
-               Esys_TRSess_SetAttributes(tpm.ctx(), tpm.session.get().tr,
-                                         TPMA_SESSION_CONTINUESESSION | attributes, 0xff));
-}
-
-Status PersistSrk(Connection& tpm) {
-  if (OpenSrk(tpm).ok()) {
-    return Status();
-  }
-  if (Status status = CreatePrimary(tpm); !status.ok()) {
-    return status;
-  }
-  ESYS_TR persistent = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_EvictControl",
-      [&] {
-        return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, tpm.primary.get().tr,
-                                       ESYS_TR_PASSWORD, ESYS_TR_NONE, ESYS_TR_NONE, kSrkHandle);
-      },
-      [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
-  if (status.ok()) {
-    tpm.srk.reset(tpm.Object(persistent));
-  }
-  return status;
 }
 
 }  // namespace keymgr::tpm

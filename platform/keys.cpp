@@ -1,0 +1,201 @@
+// The keys of the platform key manager: their template and marker, their
+// handles, creation, deletion and the sweep of stale keys.
+#include <openssl/crypto.h>
+#include <tss2/tss2_mu.h>
+
+#include <cstring>
+
+#include "crypto/hash.h"
+#include "platform/fragment.h"
+#include "platform/keys.h"
+#include "util/secure.h"
+
+namespace keymgr::tpm {
+
+namespace {
+
+// Keys this key manager creates carry this authPolicy, the SHA-256 of
+// "keymgr: sealing key of the one-off key". No policy session can reach it
+// (that would take a preimage), so it grants nothing, but it marks the key:
+// only objects that carry it, with the exact template below, are ever
+// evicted, never what other software made persistent in the owner range.
+constexpr uint8_t kKeyMarker[32] = {
+    0x6d, 0x92, 0x2a, 0xfd, 0xc6, 0xec, 0xa3, 0xf8, 0x6b, 0xc5, 0xa5, 0x93, 0xa1, 0x93, 0x9a, 0x34,
+    0x0c, 0xe7, 0x29, 0x9b, 0x0e, 0x44, 0x81, 0x0d, 0x26, 0x78, 0xc8, 0x7b, 0x01, 0x65, 0x84, 0xd6};
+constexpr TPMA_OBJECT kKeyAttributes = TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
+                                       TPMA_OBJECT_FIXEDPARENT | TPMA_OBJECT_SENSITIVEDATAORIGIN |
+                                       TPMA_OBJECT_USERWITHAUTH | TPMA_OBJECT_NODA;
+
+// Keys are made persistent in the owner range, above the handles TCG's
+// registry keeps for storage root keys (0x81000000-0x8100FFFF) and
+// endorsement keys (0x81010000-0x8101FFFF), so that a device's SRK and EK are
+// never in the way and never read when stale keys are swept.
+constexpr uint32_t kOwnKeysFirst = 0x81020000u;
+constexpr uint32_t kOwnerPersistentLast = 0x817FFFFFu;
+
+// The handle of a key is derived from the first three bytes of its name
+// digest, read big-endian. MD5 spreads the names evenly, so two live keys
+// meet on one handle with odds of about 1 in 8 million; pcp_create_key then
+// refuses rather than overwrite the other key.
+uint32_t PersistentHandle(const uint8_t* nameDigest) {
+  const uint32_t bits =
+      (uint32_t{nameDigest[0]} << 16) | (uint32_t{nameDigest[1]} << 8) | nameDigest[2];
+  return kOwnKeysFirst + bits % (kOwnerPersistentLast - kOwnKeysFirst + 1);
+}
+
+// IsOwnKey tells whether |area| is the public area of a key this key manager
+// created: its template and its marker.
+bool IsOwnKey(const TPMT_PUBLIC& area) {
+  const TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
+  return area.type == TPM2_ALG_RSA && area.nameAlg == TPM2_ALG_SHA256 &&
+         area.objectAttributes == kKeyAttributes && area.authPolicy.size == sizeof(kKeyMarker) &&
+         std::memcmp(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker)) == 0 &&
+         rsa.symmetric.algorithm == TPM2_ALG_NULL && rsa.scheme.scheme == TPM2_ALG_OAEP &&
+         rsa.scheme.details.oaep.hashAlg == TPM2_ALG_SHA256;
+}
+
+}  // namespace
+
+uint32_t HandleOfName(const char* nameHex) {
+  uint8_t nameDigest[kDigestSize];
+  (void)Md5OfString(nameHex, nameDigest);  // always 0
+  return PersistentHandle(nameDigest);
+}
+
+uint32_t ModulusSize(const TPMT_PUBLIC& area) {
+  const uint32_t size = IsOwnKey(area) ? area.parameters.rsaDetail.keyBits / 8u : 0;
+  return size > kOaepOverhead && size <= kMaxCipherSize && area.unique.rsa.size == size ? size : 0;
+}
+
+namespace {
+
+// ReadOwnKey reads the public area of the object at |handle| and fails,
+// as for a missing key, when it is not a key of this key manager.
+Status ReadOwnKey(Connection& tpm, uint32_t handle, TPM2B_PUBLIC* area) {
+  if (Status status = ReadPublic(tpm, handle, area); !status.ok()) {
+    return status;
+  }
+  return ModulusSize(area->publicArea) != 0 ? Status() : Refused("not a key of this system");
+}
+
+// KeyTemplate is the template of every key this key manager creates.
+TPM2B_TEMPLATE KeyTemplate(uint32_t bits) {
+  TPMT_PUBLIC area{};
+  area.type = TPM2_ALG_RSA;
+  area.nameAlg = TPM2_ALG_SHA256;
+  area.objectAttributes = kKeyAttributes;
+  area.authPolicy.size = sizeof(kKeyMarker);
+  std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
+  TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
+  rsa.symmetric.algorithm = TPM2_ALG_NULL;
+  rsa.scheme.scheme = TPM2_ALG_OAEP;
+  rsa.scheme.details.oaep.hashAlg = TPM2_ALG_SHA256;
+  rsa.keyBits = static_cast<TPMI_RSA_KEY_BITS>(bits);
+  rsa.exponent = 0;
+  TPM2B_TEMPLATE templ{};
+  std::size_t size = 0;
+  // A TPMT_PUBLIC always fits the template buffer.
+  (void)Tss2_MU_TPMT_PUBLIC_Marshal(&area, templ.buffer, sizeof(templ.buffer), &size);
+  templ.size = static_cast<uint16_t>(size);
+  return templ;
+}
+
+}  // namespace
+
+Status CreateKey(Connection& tpm, const uint8_t* nameDigest, const uint8_t* passwordDigest,
+                 uint32_t bits) {
+  // A larger modulus would not fit the fragment's 256 ciphertext bytes.
+  if (nameDigest == nullptr || passwordDigest == nullptr || (bits != 1024 && bits != 2048)) {
+    return Refused("pcp_create_key");
+  }
+  const uint32_t handle = PersistentHandle(nameDigest);
+  // The auth value is the first command parameter of TPM2_CreateLoaded: the
+  // salted session carries it encrypted.
+  if (Status status = UseSaltedSession(tpm, TPMA_SESSION_DECRYPT); !status.ok()) {
+    return status;
+  }
+  TPM2B_SENSITIVE_CREATE sensitive{};
+  ScopeExit wipeSensitive([&] { OPENSSL_cleanse(&sensitive, sizeof(sensitive)); });
+  sensitive.sensitive.userAuth.size = kDigestSize;
+  std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, kDigestSize);
+  const TPM2B_TEMPLATE templ = KeyTemplate(bits);
+
+  ESYS_TR loaded = ESYS_TR_NONE;
+  Output<TPM2B_PUBLIC> keyPublic;
+  if (Status status = Run(
+          tpm, "Esys_CreateLoaded",
+          [&] {
+            return Esys_CreateLoaded_Async(tpm.ctx(), tpm.Parent(), tpm.session.get().tr,
+                                           ESYS_TR_NONE, ESYS_TR_NONE, &sensitive, &templ);
+          },
+          [&] { return Esys_CreateLoaded_Finish(tpm.ctx(), &loaded, nullptr, keyPublic.out()); });
+      !status.ok()) {
+    return status;
+  }
+  TransientObject loadedKey(tpm.Object(loaded));
+  // The handle is checked by the TPM itself: the eviction fails when it is
+  // taken.
+  ESYS_TR persistent = ESYS_TR_NONE;
+  if (Status status = Run(
+          tpm, "Esys_EvictControl",
+          [&] {
+            return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, loaded, ESYS_TR_PASSWORD,
+                                           ESYS_TR_NONE, ESYS_TR_NONE, handle);
+          },
+          [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
+      !status.ok()) {
+    return status;
+  }
+  PersistentObject key(tpm.Object(persistent));
+  // The public area came from the TPM with the key: sealing to it in the same
+  // connection needs no command.
+  tpm.createdHandle = handle;
+  tpm.createdPublic = *keyPublic.get();
+  return Status();
+}
+
+// An object this key manager did not create is left alone, as if absent.
+Status DeleteKey(Connection& tpm, const uint8_t* nameDigest) {
+  if (nameDigest == nullptr) {
+    return Refused("pcp_delete_key");
+  }
+  const uint32_t handle = PersistentHandle(nameDigest);
+  TPM2B_PUBLIC area{};
+  if (Status status = ReadOwnKey(tpm, handle, &area); !status.ok()) {
+    return status;
+  }
+  return EvictPersistent(tpm, handle);
+}
+
+Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
+  const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
+  TPMI_YES_NO more = TPM2_NO;
+  Output<TPMS_CAPABILITY_DATA> data;
+  if (Status status = Run(
+          tpm, "Esys_GetCapability",
+          [&] {
+            return Esys_GetCapability_Async(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
+                                            TPM2_CAP_HANDLES, kOwnKeysFirst, TPM2_MAX_CAP_HANDLES);
+          },
+          [&] { return Esys_GetCapability_Finish(tpm.ctx(), &more, data.out()); });
+      !status.ok()) {
+    return status;
+  }
+  // A TPM holds a handful of persistent objects, far fewer than one answer
+  // can list, so |more| is not followed.
+  Status result;
+  const TPML_HANDLE& handles = data.get()->data.handles;
+  for (uint32_t i = 0; i < handles.count; ++i) {
+    const uint32_t handle = handles.handle[i];
+    TPM2B_PUBLIC area{};
+    if (handle > kOwnerPersistentLast || handle == keep || !ReadOwnKey(tpm, handle, &area).ok()) {
+      continue;
+    }
+    if (Status status = EvictPersistent(tpm, handle); !status.ok()) {
+      result = status;
+    }
+  }
+  return result;
+}
+
+}  // namespace keymgr::tpm

@@ -1,0 +1,178 @@
+// The storage parent of the keys and the sessions that carry secrets.
+#include <time.h>
+
+#include <cstring>
+
+#include "crypto/hash.h"
+#include "platform/tpm.h"
+#include "util/random.h"
+
+namespace keymgr::tpm {
+
+namespace {
+
+// The storage template of TCG's provisioning guidance: ECC P-256, AES-128
+// CFB, no policy, an all-zero unique field. Created with it, the primary is
+// the same key as the persistent SRK.
+TPM2B_PUBLIC SrkTemplate() {
+  TPM2B_PUBLIC templ{};
+  TPMT_PUBLIC& area = templ.publicArea;
+  area.type = TPM2_ALG_ECC;
+  area.nameAlg = TPM2_ALG_SHA256;
+  area.objectAttributes = TPMA_OBJECT_RESTRICTED | TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
+                          TPMA_OBJECT_FIXEDPARENT | TPMA_OBJECT_SENSITIVEDATAORIGIN |
+                          TPMA_OBJECT_USERWITHAUTH | TPMA_OBJECT_NODA;
+  TPMS_ECC_PARMS& ecc = area.parameters.eccDetail;
+  ecc.symmetric.algorithm = TPM2_ALG_AES;
+  ecc.symmetric.keyBits.aes = 128;
+  ecc.symmetric.mode.aes = TPM2_ALG_CFB;
+  ecc.scheme.scheme = TPM2_ALG_NULL;
+  ecc.curveID = TPM2_ECC_NIST_P256;
+  ecc.kdf.scheme = TPM2_ALG_NULL;
+  area.unique.ecc.x.size = 32;
+  area.unique.ecc.y.size = 32;
+  return templ;
+}
+
+// IsStandardSrk tells whether |area| was made from the storage template.
+bool IsStandardSrk(const TPMT_PUBLIC& area) {
+  const TPMT_PUBLIC expected = SrkTemplate().publicArea;
+  const TPMS_ECC_PARMS& ecc = area.parameters.eccDetail;
+  const TPMS_ECC_PARMS& want = expected.parameters.eccDetail;
+  return area.type == expected.type && area.nameAlg == expected.nameAlg &&
+         area.objectAttributes == expected.objectAttributes && area.authPolicy.size == 0 &&
+         ecc.symmetric.algorithm == want.symmetric.algorithm &&
+         ecc.symmetric.keyBits.aes == want.symmetric.keyBits.aes &&
+         ecc.symmetric.mode.aes == want.symmetric.mode.aes &&
+         ecc.scheme.scheme == want.scheme.scheme && ecc.curveID == want.curveID &&
+         ecc.kdf.scheme == want.kdf.scheme;
+}
+
+Status CreatePrimary(Connection& tpm) {
+  TPM2B_SENSITIVE_CREATE sensitive{};
+  const TPM2B_PUBLIC templ = SrkTemplate();
+  TPM2B_DATA outsideInfo{};
+  TPML_PCR_SELECTION pcrs{};
+  ESYS_TR primary = ESYS_TR_NONE;
+  Status status = Run(
+      tpm, "Esys_CreatePrimary",
+      [&] {
+        return Esys_CreatePrimary_Async(tpm.ctx(), ESYS_TR_RH_OWNER, ESYS_TR_PASSWORD, ESYS_TR_NONE,
+                                        ESYS_TR_NONE, &sensitive, &templ, &outsideInfo, &pcrs);
+      },
+      [&] {
+        return Esys_CreatePrimary_Finish(tpm.ctx(), &primary, nullptr, nullptr, nullptr, nullptr);
+      });
+  if (status.ok()) {
+    tpm.primary.reset(tpm.Object(primary));
+  }
+  return status;
+}
+
+// OpenSrk finds the standard SRK at kSrkHandle, when it is there.
+Status OpenSrk(Connection& tpm) {
+  TPM2B_PUBLIC area{};
+  if (Status status = ReadPublic(tpm, kSrkHandle, &area); !status.ok()) {
+    return status;
+  }
+  if (!IsStandardSrk(area.publicArea)) {
+    return Refused("not the standard SRK");
+  }
+  ESYS_TR srk = ESYS_TR_NONE;
+  Status status = Run(
+      tpm, "Esys_TR_FromTPMPublic",
+      [&] {
+        return Esys_TR_FromTPMPublic_Async(tpm.ctx(), kSrkHandle, ESYS_TR_NONE, ESYS_TR_NONE,
+                                           ESYS_TR_NONE);
+      },
+      [&] { return Esys_TR_FromTPMPublic_Finish(tpm.ctx(), &srk); });
+  if (status.ok()) {
+    tpm.srk.reset(tpm.Object(srk));
+  }
+  return status;
+}
+
+}  // namespace
+
+Status UseParent(Connection& tpm) {
+  if (tpm.primary || tpm.srk) {
+    return Status();
+  }
+  // Without the SRK, or with something else at its handle, the same key is
+  // made from the template.
+  if (OpenSrk(tpm).ok()) {
+    return Status();
+  }
+  return tpm.broken ? Refused("TPM connection lost") : CreatePrimary(tpm);
+}
+
+Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session) {
+  TPMT_SYM_DEF symmetric{};
+  symmetric.algorithm = TPM2_ALG_AES;
+  symmetric.keyBits.aes = 128;
+  symmetric.mode.aes = TPM2_ALG_CFB;
+  *session = ESYS_TR_NONE;
+  // Left to ESAPI, the nonce would come from OpenSSL's generator, which
+  // waits for the kernel's pool. The TPM's nonce makes the session fresh;
+  // this one need only differ from run to run, which the clock ensures
+  // while the pool is not ready.
+  TPM2B_NONCE nonce{};
+  nonce.size = crypto::kSha256Size;
+  if (!KernelRandom(nonce.buffer, nonce.size, KernelWait::kNo)) {
+    timespec clocks[2]{};
+    clock_gettime(CLOCK_REALTIME, &clocks[0]);
+    clock_gettime(CLOCK_MONOTONIC, &clocks[1]);
+    crypto::Sha256 sha;
+    (void)sha.Update(clocks, sizeof(clocks));
+    (void)sha.Final(std::span<std::uint8_t, crypto::kSha256Size>(nonce.buffer, nonce.size));
+  }
+  return Run(
+      tpm, "Esys_StartAuthSession",
+      [&] {
+        return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
+                                           ESYS_TR_NONE, &nonce, TPM2_SE_HMAC, &symmetric,
+                                           TPM2_ALG_SHA256);
+      },
+      [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });
+}
+
+Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes) {
+  if (!tpm.session) {
+    if (Status status = UseParent(tpm); !status.ok()) {
+      return status;
+    }
+    ESYS_TR session = ESYS_TR_NONE;
+    if (Status status = StartHmacSession(tpm, tpm.Parent(), ESYS_TR_NONE, &session); !status.ok()) {
+      return status;
+    }
+    tpm.session.reset(tpm.Object(session));
+  }
+  // The session stays loaded after each command, so that it is flushed with
+  // the connection on every path, failed commands included.
+  return Check("Esys_TRSess_SetAttributes",
+               Esys_TRSess_SetAttributes(tpm.ctx(), tpm.session.get().tr,
+                                         TPMA_SESSION_CONTINUESESSION | attributes, 0xff));
+}
+
+Status PersistSrk(Connection& tpm) {
+  if (OpenSrk(tpm).ok()) {
+    return Status();
+  }
+  if (Status status = CreatePrimary(tpm); !status.ok()) {
+    return status;
+  }
+  ESYS_TR persistent = ESYS_TR_NONE;
+  Status status = Run(
+      tpm, "Esys_EvictControl",
+      [&] {
+        return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, tpm.primary.get().tr,
+                                       ESYS_TR_PASSWORD, ESYS_TR_NONE, ESYS_TR_NONE, kSrkHandle);
+      },
+      [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
+  if (status.ok()) {
+    tpm.srk.reset(tpm.Object(persistent));
+  }
+  return status;
+}
+
+}  // namespace keymgr::tpm
