@@ -5,26 +5,17 @@
 #include <array>
 #include <cctype>
 #include <cstdint>
-#include <cstdlib>
 #include <cstring>
 #include <memory>
 #include <vector>
 
 #include "cli/command.h"
+#include "support/files.h"
 #include "tools/eeprom_args.h"
 #include "tools/host_args.h"
 
-namespace {
-
-void Check(bool holds) {
-  if (!holds) {
-    std::abort();
-  }
-}
-
-}  // namespace
-
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+  using keymgr::test::Require;
   std::vector<std::unique_ptr<char[]>> pieces;
   const auto add = [&](const char* begin, std::size_t length) {
     pieces.push_back(std::make_unique<char[]>(length + 1));
@@ -47,13 +38,13 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
 
   using keymgr::cli::Action;
   const keymgr::cli::Command command = keymgr::cli::ParseCommand(argc, argv.data());
-  Check(command.path == (command.action == Action::kFile && argc > 2 ? argv[2] : nullptr));
-  Check(command.verbose == 0 || command.action == Action::kVerify);
+  Require(command.path == (command.action == Action::kFile && argc > 2 ? argv[2] : nullptr));
+  Require(command.verbose == 0 || command.action == Action::kVerify);
 
   using Host = keymgr::tools::HostArgs;
   const Host host = keymgr::tools::ParseHostArgs(argc, argv.data());
-  Check(host.action != Host::Action::kManage || argc == 2 || argc == 3);
-  Check(host.action != Host::Action::kUsage || (host.option == 0 && host.logFlag == 0));
+  Require(host.action != Host::Action::kManage || argc == 2 || argc == 3);
+  Require(host.action != Host::Action::kUsage || (host.option == 0 && host.logFlag == 0));
 
   using Eeprom = keymgr::tools::EepromArgs;
   static std::array<std::uint8_t, keymgr::eeprom::kSize> bytes;
@@ -61,12 +52,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   if (eeprom.action == Eeprom::Action::kWrite) {
     // The bytes spell the hex argument, digit for digit.
     const char* hex = argv[3];
-    Check(2 * eeprom.length == std::strlen(hex));
+    Require(2 * eeprom.length == std::strlen(hex));
     for (std::size_t i = 0; i < eeprom.length && eeprom.length <= bytes.size(); ++i) {
-      const char high = "0123456789abcdef"[bytes[i] >> 4];
-      const char low = "0123456789abcdef"[bytes[i] & 15];
-      Check(std::tolower(static_cast<unsigned char>(hex[2 * i])) == high &&
-            std::tolower(static_cast<unsigned char>(hex[2 * i + 1])) == low);
+      Require(std::tolower(static_cast<unsigned char>(hex[2 * i])) ==
+                  "0123456789abcdef"[bytes[i] >> 4] &&
+              std::tolower(static_cast<unsigned char>(hex[2 * i + 1])) ==
+                  "0123456789abcdef"[bytes[i] & 15]);
     }
   }
   return 0;

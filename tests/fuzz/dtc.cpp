@@ -9,13 +9,14 @@
 
 #include <array>
 #include <cstdint>
-#include <cstdlib>
 #include <vector>
 
 #include "crypto/dtc.h"
+#include "support/files.h"
 
 namespace {
 
+using keymgr::test::Require;
 using Bytes = std::vector<std::uint8_t>;
 
 // The services accept at most 1024 bytes; the arrays leave room beyond that
@@ -24,12 +25,6 @@ constexpr std::uint32_t kArraySize = 1100;
 // Static, because the library's constant 1 may stay bound to one across runs.
 std::array<std::array<std::uint8_t, kArraySize>, 3> g_arrays;
 std::array<ProtectedKey, 3> g_records;
-
-void Check(bool holds) {
-  if (!holds) {
-    std::abort();
-  }
-}
 
 ProtectedKey* Constant(std::uint32_t index) {
   ProtectedKey* ref = nullptr;
@@ -56,30 +51,15 @@ Bytes Plain(const ProtectedKey* key, std::uint32_t count) {
   return bytes;
 }
 
-Bytes Arrays() {
-  Bytes all;
-  for (const auto& array : g_arrays) {
-    all.insert(all.end(), array.begin(), array.end());
-  }
-  return all;
-}
-
-Bytes Sha256(const Bytes& in) {
-  Bytes out(32);
-  Check(EVP_Digest(in.data(), in.size(), out.data(), nullptr, EVP_sha256(), nullptr) == 1);
-  return out;
-}
-
 Bytes Aes(bool encrypt, const Bytes& key, const Bytes& iv, const Bytes& in) {
   Bytes out(in.size() + 16);
-  int moved = 0;
-  int last = 0;
+  int moved = 0, last = 0;
   EVP_CIPHER_CTX* ctx = EVP_CIPHER_CTX_new();
-  Check(ctx != nullptr &&
-        EVP_CipherInit_ex(ctx, EVP_aes_256_cbc(), nullptr, key.data(), iv.data(), encrypt) == 1 &&
-        EVP_CIPHER_CTX_set_padding(ctx, 0) == 1 &&
-        EVP_CipherUpdate(ctx, out.data(), &moved, in.data(), static_cast<int>(in.size())) == 1 &&
-        EVP_CipherFinal_ex(ctx, out.data() + moved, &last) == 1);
+  Require(ctx != nullptr &&
+          EVP_CipherInit_ex(ctx, EVP_aes_256_cbc(), nullptr, key.data(), iv.data(), encrypt) == 1 &&
+          EVP_CIPHER_CTX_set_padding(ctx, 0) == 1 &&
+          EVP_CipherUpdate(ctx, out.data(), &moved, in.data(), static_cast<int>(in.size())) == 1 &&
+          EVP_CipherFinal_ex(ctx, out.data() + moved, &last) == 1);
   EVP_CIPHER_CTX_free(ctx);
   out.resize(static_cast<std::size_t>(moved + last));
   return out;
@@ -87,8 +67,7 @@ Bytes Aes(bool encrypt, const Bytes& key, const Bytes& iv, const Bytes& in) {
 
 struct Job {
   CryptoContainer container;
-  bool aesReady = false;
-  bool encrypt = false;
+  bool aesReady = false, encrypt = false;
   Bytes key, iv;  // plain, as they were when the AES job was set up
 };
 
@@ -114,16 +93,15 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const auto selector = [&](std::uint32_t valid) {
     return in.ConsumeBool() ? valid : in.ConsumeIntegral<std::uint32_t>();
   };
+  const auto length = [&] { return in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize); };
   std::vector<Job> jobs;
   // job picks one of the live containers, or none when there is none.
   const auto job = [&]() -> Job* {
     return jobs.empty() ? nullptr
                         : &jobs[in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1)];
   };
-  const auto length = [&] { return in.ConsumeIntegralInRange<std::uint32_t>(0, kArraySize); };
-
   for (int step = 0; step < 64 && in.remaining_bytes() > 0; ++step) {
-    const Bytes before = Arrays();
+    const auto before = g_arrays;
     std::uint32_t code = 0;
     switch (in.ConsumeIntegralInRange(0, 7)) {
       case 0: {
@@ -131,15 +109,14 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         ProtectedKey* ref = nullptr;
         std::uint32_t refLength = 0;
         code = VKT_DTC_GetConstant(index, &ref, &refLength);
-        Check((code == 0) == (index >= 1 && index <= 3) && (ref != nullptr) == (code == 0));
+        Require((code == 0) == (index >= 1 && index <= 3) && (ref != nullptr) == (code == 0));
         break;
       }
-      case 1: {
+      case 1: {  // an attachment writes nothing, refused or not
         ProtectedKey* key = record();
         const auto array = in.ConsumeIntegralInRange<std::size_t>(0, 2);
-        code = ProtectedKey_Attach(key, in.ConsumeBool() ? 0 : in.ConsumeIntegral<std::uint32_t>(),
-                                   g_arrays[array].data());
-        continue;  // an attachment writes nothing, refused or not
+        (void)ProtectedKey_Attach(key, selector(0), g_arrays[array].data());
+        continue;
       }
       case 2: {
         ProtectedKey* key = record();
@@ -149,21 +126,19 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         }
         const Bytes plain = Plain(key, count);
         code = ProtectedKey_SetLength(key, count);
-        Check(code != 0 || Plain(key, count) == plain);
+        Require(code != 0 || Plain(key, count) == plain);
         break;
       }
       case 3:
         if (jobs.size() < 4) {
-          CryptoContainer container = VKT_DTC_CreateCryptoContainer();
-          Check(container != nullptr);
-          jobs.push_back(Job{container, false, false, {}, {}});
+          jobs.push_back(Job{VKT_DTC_CreateCryptoContainer()});
+          Require(jobs.back().container != nullptr);
         }
         continue;
       case 4:
-        if (!jobs.empty()) {
-          const auto at = in.ConsumeIntegralInRange<std::size_t>(0, jobs.size() - 1);
-          Check(VKT_DTC_DestroyCryptoContainer(jobs[at].container) == 0);
-          jobs.erase(jobs.begin() + static_cast<std::ptrdiff_t>(at));
+        if (Job* live = job()) {
+          Require(VKT_DTC_DestroyCryptoContainer(live->container) == 0);
+          jobs.erase(jobs.begin() + (live - jobs.data()));
         }
         continue;
       case 5: {
@@ -175,10 +150,13 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         if (hash == nullptr || count > Capacity(input) || Capacity(output) < 32) {
           continue;
         }
-        const Bytes expected = Sha256(Plain(input, count));
+        const Bytes plain = Plain(input, count);
+        const std::string expected =
+            keymgr::test::Sha256({reinterpret_cast<const char*>(plain.data()), plain.size()});
         code = VKT_DTC_GetHash(hash->container, selector(DTC_HASH_SELECTOR), input, count, output,
                                &produced);
-        Check(code != 0 || (produced == 32 && Plain(output, 32) == expected));
+        Require(code != 0 ||
+                (produced == 32 && Plain(output, 32) == Bytes(expected.begin(), expected.end())));
         break;
       }
       case 6: {
@@ -198,7 +176,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         }
         break;
       }
-      case 7: {
+      default: {
         Job* aes = job();
         const ProtectedKey* input = record();
         ProtectedKey* output = record();
@@ -209,16 +187,16 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         }
         const Bytes plain = Plain(input, count);
         code = VKT_DTC_AES_Process(aes->container, input, count, output, &produced);
-        Check(code != 0 || (aes->aesReady && produced == count &&
-                            Plain(output, count) == Aes(aes->encrypt, aes->key, aes->iv, plain)));
+        Require(code != 0 || (aes->aesReady && produced == count &&
+                              Plain(output, count) == Aes(aes->encrypt, aes->key, aes->iv, plain)));
         aes->aesReady = aes->aesReady && code != 0;
         break;
       }
     }
-    Check(code == 0 || Arrays() == before);
+    Require(code == 0 || g_arrays == before);
   }
   for (const Job& live : jobs) {
-    Check(VKT_DTC_DestroyCryptoContainer(live.container) == 0);
+    Require(VKT_DTC_DestroyCryptoContainer(live.container) == 0);
   }
   return 0;
 }

@@ -9,123 +9,65 @@
 // undamaged digest file and a manifest with no failing entry. For any
 // manifest, the verbose and quiet runs agree.
 #include <fuzzer/FuzzedDataProvider.h>
-#include <openssl/sha.h>
-#include <unistd.h>
 
 #include <array>
 #include <cstdint>
 #include <cstdio>
-#include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <string>
-#include <vector>
 
-#include "bootlog/boot_status.h"
 #include "integrity/manifest.h"
+#include "support/files.h"
 #include "util/paths.h"
 
 namespace {
 
 namespace fs = std::filesystem;
 using namespace keymgr;
+using test::Require;
 
 constexpr std::size_t kDataFiles = 4;
-// Large enough for a file to take more than one read and reach the threads
-// that hash ahead.
-constexpr std::size_t kMaxDataSize = 300 * 1024;
-constexpr std::size_t kMaxEntries = 40;
 constexpr char kSpaces[] = " \t\n\v\f\r";
-
-std::string Read(const char* path) {
-  std::ifstream in(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(in), {}};
-}
-
-void Write(const std::string& path, const std::string& bytes) {
-  std::ofstream(path, std::ios::binary | std::ios::trunc)
-      .write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-}
-
-std::string Sha256(const std::string& bytes) {
-  std::array<unsigned char, SHA256_DIGEST_LENGTH> digest{};
-  SHA256(reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(), digest.data());
-  return {reinterpret_cast<const char*>(digest.data()), digest.size()};
-}
 
 // Verify runs the boot check and returns its result and whether it logged
 // BN=OK.
 std::pair<int, bool> Verify(int verbose) {
   std::remove(kBootLogPath);
   const int result = VerifyManifest(verbose);
-  const std::string log = Read(kBootLogPath);
-  if (log != "BN=OK\n" && log != "BN=FAIL\n") {
-    std::abort();
-  }
+  const auto log = test::ReadFile(kBootLogPath);
+  Require(log == "BN=OK\n" || log == "BN=FAIL\n");
   return {result, log == "BN=OK\n"};
 }
 
-// Model is what a laid-out manifest must give: the records written, and
-// whether every entry can be hashed.
-struct Model {
-  std::string records;
-  bool allHashed = true;
-};
-
-// LayOut writes a manifest of entries chosen by |in| and returns its model.
+// LayOut writes a manifest of entries chosen by |in|, and sets |records| to
+// the records it must give and |allHashed| to whether every entry hashes.
 std::string LayOut(FuzzedDataProvider& in, const std::array<std::string, kDataFiles>& data,
-                   Model& model) {
+                   std::string& records, bool& allHashed) {
   std::string text;
-  const std::size_t count = in.ConsumeIntegralInRange<std::size_t>(0, kMaxEntries);
+  const std::size_t count = in.ConsumeIntegralInRange<std::size_t>(0, 40);
   for (std::size_t i = 0; i < count; ++i) {
     text.append(in.ConsumeIntegralInRange<std::size_t>(i == 0 ? 0 : 1, 3),
                 kSpaces[in.ConsumeIntegralInRange<std::size_t>(0, sizeof(kSpaces) - 2)]);
-    std::string entry;
-    bool hashed = false;
-    switch (in.ConsumeIntegralInRange(0, 5)) {
-      case 0:
-      case 1: {
-        const std::size_t file = in.ConsumeIntegralInRange<std::size_t>(0, kDataFiles - 1);
-        entry = "f" + std::to_string(file);
-        hashed = true;
-        if (model.allHashed) {
-          model.records += Sha256(data[file]);
-        }
-        break;
-      }
-      case 2:
-        entry = "missing";
-        break;
-      case 3:
-        entry = "dir";
-        break;
-      case 4:  // 99 characters fit the path buffer, 100 or more do not
-        entry = std::string(in.ConsumeIntegralInRange<std::size_t>(99, 120), 'n');
-        break;
-      default:
-        entry = std::string("f0\0x", 4).substr(0, in.ConsumeIntegralInRange<std::size_t>(3, 4));
-        break;
+    const int kind = in.ConsumeIntegralInRange(0, 5);
+    const std::size_t file = in.ConsumeIntegralInRange<std::size_t>(0, kDataFiles - 1);
+    if (kind <= 1 && allHashed) {
+      records += test::Sha256(data[file]);
     }
-    model.allHashed = model.allHashed && hashed;
-    text += entry;
+    allHashed = allHashed && kind <= 1;
+    // 99 characters fit the path buffer, 100 or more do not.
+    text += kind <= 1   ? "f" + std::to_string(file)
+            : kind == 2 ? "missing"
+            : kind == 3 ? "dir"
+            : kind == 4 ? std::string(in.ConsumeIntegralInRange<std::size_t>(99, 120), 'n')
+                        : std::string("f0\0x", in.ConsumeIntegralInRange<std::size_t>(3, 4));
   }
-  text.append(in.ConsumeIntegralInRange<std::size_t>(0, 2), '\n');
-  return text;
+  return text.append(in.ConsumeIntegralInRange<std::size_t>(0, 2), '\n');
 }
 
-// Scratch is the folder the manifest's names are read in.
+// The folder the manifest's names are read in.
 fs::path Scratch() {
   return fs::path(kManifestPath).parent_path().parent_path() / "fuzz-files";
 }
-
-// InScratch makes the scratch folder the working one for a run and restores
-// libFuzzer's, which resolves its corpus and artifact paths, afterwards.
-struct InScratch {
-  InScratch() : home(fs::current_path()) { fs::current_path(Scratch()); }
-  ~InScratch() { fs::current_path(home); }
-  fs::path home;
-};
 
 }  // namespace
 
@@ -139,52 +81,47 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t size) {
   FuzzedDataProvider in(input, size);
-  const InScratch scratch;
+  // The scratch folder is the working one for the run; libFuzzer's, which
+  // resolves its corpus and artifact paths, is restored afterwards.
+  const fs::path home = fs::current_path();
+  fs::current_path(Scratch());
   std::array<std::string, kDataFiles> data;
   for (std::size_t i = 0; i < kDataFiles; ++i) {
-    if (in.ConsumeBool()) {
-      data[i].assign(in.ConsumeIntegralInRange<std::size_t>(0, kMaxDataSize),
-                     static_cast<char>(in.ConsumeIntegral<std::uint8_t>()));
-    } else {
-      data[i] = in.ConsumeRandomLengthString(64);
-    }
-    Write("f" + std::to_string(i), data[i]);
+    // Large enough for a file to take more than one read and reach the
+    // threads that hash ahead.
+    data[i] = in.ConsumeBool() ? std::string(in.ConsumeIntegralInRange<std::size_t>(0, 300 * 1024),
+                                             static_cast<char>(in.ConsumeIntegral<std::uint8_t>()))
+                               : in.ConsumeRandomLengthString(64);
+    test::WriteFile("f" + std::to_string(i), data[i]);
   }
   const bool laidOut = in.ConsumeBool();
-  Model model;
-  const std::string manifest = laidOut ? LayOut(in, data, model) : in.ConsumeRandomLengthString();
+  std::string model;
+  bool allHashed = true;
+  const std::string manifest =
+      laidOut ? LayOut(in, data, model, allHashed) : in.ConsumeRandomLengthString();
   // Raw manifests name only files in the scratch folder.
-  if (manifest.find('/') != std::string::npos) {
-    return 0;
-  }
-  Write(kManifestPath, manifest);
-  std::remove(kDigestFilePath);
-  if (HashManifest() != 0) {
-    std::abort();
-  }
-  std::string records = Read(kDigestFilePath);
-  if (laidOut && records != model.records) {
-    std::abort();
-  }
-  // Damage: one byte changed, or the file cut short.
-  const int damage = in.ConsumeIntegralInRange(0, 2);
-  if (damage != 0 && !records.empty()) {
-    const std::size_t at = in.ConsumeIntegralInRange<std::size_t>(0, records.size() - 1);
-    if (damage == 1) {
-      records[at] = static_cast<char>(records[at] ^ (in.ConsumeIntegral<std::uint8_t>() | 1));
-    } else {
-      records.resize(at);
+  if (manifest.find('/') == std::string::npos) {
+    test::WriteFile(kManifestPath, manifest);
+    std::remove(kDigestFilePath);
+    Require(HashManifest() == 0);
+    std::string records = test::ReadFile(kDigestFilePath).value_or("");
+    Require(!laidOut || records == model);
+    // Damage: one byte changed, or the file cut short.
+    const int damage = in.ConsumeIntegralInRange(0, 2);
+    if (damage != 0 && !records.empty()) {
+      const std::size_t at = in.ConsumeIntegralInRange<std::size_t>(0, records.size() - 1);
+      if (damage == 1) {
+        records[at] = static_cast<char>(records[at] ^ (in.ConsumeIntegral<std::uint8_t>() | 1));
+      } else {
+        records.resize(at);
+      }
+      test::WriteFile(kDigestFilePath, records);
     }
-    Write(kDigestFilePath, records);
+    const auto quiet = Verify(0);
+    Require(Verify(1) == quiet && quiet.first == 0);
+    Require(!laidOut || quiet.second == (allHashed && (damage == 0 || model.empty())));
+    VerifyManifestFile(in.ConsumeRandomLengthString(8).c_str());
   }
-  const bool damaged = damage != 0 && !model.records.empty();
-  const auto quiet = Verify(0);
-  if (Verify(1) != quiet || quiet.first != 0) {
-    std::abort();
-  }
-  if (laidOut && quiet.second != (model.allHashed && !damaged)) {
-    std::abort();
-  }
-  VerifyManifestFile(in.ConsumeRandomLengthString(8).c_str());
+  fs::current_path(home);
   return 0;
 }

@@ -13,13 +13,11 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <string>
 
 #include "crypto/hash.h"
-#include "platform/eeprom_map.h"
 #include "support/fake_platform.h"
+#include "support/files.h"
 #include "util/bytes.h"
 #include "util/paths.h"
 
@@ -28,22 +26,10 @@ namespace {
 namespace fs = std::filesystem;
 using namespace keymgr;
 
-constexpr const char* kFiles[] = {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath};
-
-std::string Read(const char* path) {
-  std::ifstream in(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(in), {}};
-}
-
-void Write(const char* path, const std::string& bytes) {
-  std::ofstream(path, std::ios::binary | std::ios::trunc)
-      .write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-}
-
 // Md5OfHex is the key manager's name for 20 bytes of a key file: the MD5 of
 // their hex text.
 std::string Md5OfHex(const char* path) {
-  std::string bytes = Read(path);
+  std::string bytes = test::ReadFile(path).value_or("");
   bytes.resize(20);
   char hex[41] = {};
   std::uint8_t digest[16] = {};
@@ -68,28 +54,21 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   test::FakeKeyManager& keyManager = test::KeyManager();
   eeprom.Reset();
   keyManager.Reset();
-  for (const char* path : {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath, kBootLogPath}) {
-    std::error_code ignored;
-    fs::remove(path, ignored);
+  const char* files[] = {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath, kBootLogPath};
+  for (const char* path : files) {
+    std::remove(path);
   }
   std::srand(1);
   eeprom.image[eeprom::kSfeConfOffset] = eeprom::kSfe003Mask;  // DT lines reach the log
   const bool regenerated = in.ConsumeBool();
-  if (regenerated && KeyManage(KMM_OPTION_REGENERATE, 0) == nullptr) {
-    std::abort();
-  }
-
-  bool altered = false;
+  test::Require(!regenerated || KeyManage(KMM_OPTION_REGENERATE, 0) != nullptr);
+  const bool altered = in.remaining_bytes() > 0;
   while (in.remaining_bytes() > 0) {
-    altered = true;
     switch (in.ConsumeIntegralInRange(0, 4)) {
       case 0: {
-        const char* path = kFiles[in.ConsumeIntegralInRange(0, 3)];
-        if (in.ConsumeBool()) {
-          fs::remove(path);
-        } else {
-          Write(path, in.ConsumeRandomLengthString(400));
-        }
+        const char* path = files[in.ConsumeIntegralInRange(0, 3)];
+        in.ConsumeBool() ? (void)std::remove(path)
+                         : test::WriteFile(path, in.ConsumeRandomLengthString(400));
         break;
       }
       case 1: {
@@ -99,25 +78,23 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         break;
       }
       case 2:
-        eeprom.fault.begin = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize);
-        eeprom.fault.end = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize);
-        eeprom.fault.count = in.ConsumeIntegralInRange(0, 4);
+        eeprom.fault = {in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
+                        in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
+                        in.ConsumeIntegralInRange(0, 4)};
         break;
       case 3:
         keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0u, 3u);
         break;
-      case 4:
+      default:
         keyManager.keys[Md5OfHex(kKeyIdPath)] = Md5OfHex(kKeyPwdPath);
         break;
     }
   }
-
   const KeyContext* context = KeyManage(KMM_OPTION_NORMAL_BOOT, 1);
-  const std::string log = Read(kBootLogPath);
-  if ((regenerated && !altered && context == nullptr) ||
-      (!log.empty() && log != (context != nullptr ? "DT=OK\n" : "DT=FAIL\n")) ||
-      (context != nullptr && (context->secretKeyLength != 48 || context->storeKeyLength != 48))) {
-    std::abort();
-  }
+  const std::string log = test::ReadFile(kBootLogPath).value_or("");
+  test::Require(
+      (!regenerated || altered || context != nullptr) &&
+      (log.empty() || log == (context != nullptr ? "DT=OK\n" : "DT=FAIL\n")) &&
+      (context == nullptr || (context->secretKeyLength == 48 && context->storeKeyLength == 48)));
   return 0;
 }

@@ -5,10 +5,8 @@
 #include <kmm/kmm.h>
 
 #include <algorithm>
-#include <cstring>
 #include <filesystem>
 #include <functional>
-#include <map>
 #include <regex>
 
 #include "kmm/internal.h"
@@ -21,27 +19,29 @@
 namespace keymgr::test {
 namespace {
 
-// The |at|-th call (1-based) of |call| fails: a create returns no container;
+// The |at|-th call (from 1) of |call| fails: a create returns no container;
 // the others return |code|, or with code 0 run and report |length| as output.
 enum CryptoCall { kCreate, kHash, kAesProcess };
 struct CryptoFault {
   int call = -1, at = 0;
   std::uint32_t code = 0, length = 0;
-};
-CryptoFault g_fault;
+} g_fault;
 std::array<int, 3> g_calls{};
 int g_live = 0;  // containers created and not yet destroyed
 
 bool Hit(int call) {
   return ++g_calls[call] == g_fault.at && call == g_fault.call;
 }
-template <class Run>
-std::uint32_t Faulty(int call, std::uint32_t* outLength, Run run) {
-  bool hit = Hit(call);
-  std::uint32_t result = hit && g_fault.code != 0 ? g_fault.code : run();
-  if (hit && g_fault.code == 0) {
-    *outLength = g_fault.length;
+std::uint32_t Faulty(int call, std::uint32_t* outLength,
+                     const std::function<std::uint32_t()>& run) {
+  if (!Hit(call)) {
+    return run();
   }
+  if (g_fault.code != 0) {
+    return g_fault.code;
+  }
+  const std::uint32_t result = run();
+  *outLength = g_fault.length;
   return result;
 }
 
@@ -58,11 +58,9 @@ uint32_t __real_VKT_DTC_GetHash(CryptoContainer, uint32_t, const ProtectedKey*, 
 uint32_t __real_VKT_DTC_AES_Process(CryptoContainer, const ProtectedKey*, uint32_t, ProtectedKey*,
                                     uint32_t*);
 CryptoContainer __wrap_VKT_DTC_CreateCryptoContainer(void) {
-  if (Hit(kCreate)) {
-    return nullptr;
-  }
-  ++g_live;
-  return __real_VKT_DTC_CreateCryptoContainer();
+  const bool fails = Hit(kCreate);
+  g_live += fails ? 0 : 1;
+  return fails ? nullptr : __real_VKT_DTC_CreateCryptoContainer();
 }
 uint32_t __wrap_VKT_DTC_DestroyCryptoContainer(CryptoContainer c) {
   --g_live;
@@ -104,39 +102,32 @@ void Reset() {
   g_calls = {};
 }
 
-// Call runs KeyManage with stdout captured and its result kept in g_context;
-// the asctime text of the banners is checked and replaced by "T".
+// Call runs KeyManage, keeps its result in g_context and returns what it
+// printed, with the asctime text of the banners checked and replaced by "T".
 KeyContext* g_context = nullptr;
 std::string Call(int option, int logFlag = 1) {
-  testing::internal::CaptureStdout();
-  g_context = KeyManage(option, logFlag);
-  std::string out = testing::internal::GetCapturedStdout();
   static const std::regex kTime(R"( (Start|End) KMM : \w{3} \w{3} [ \d]\d \d\d:\d\d:\d\d \d{4}\n)");
-  return std::regex_replace(out, kTime, " $1 KMM : T\n");
+  return std::regex_replace(Output([&] { g_context = KeyManage(option, logFlag); }), kTime,
+                            " $1 KMM : T\n");
 }
 
-// Retries is |line| with the counter values 2, 1 and 0 of the three attempts.
-std::string Retries(const std::string& line) {
-  return line + "2]!!!\n" + line + "1]!!!\n" + line + "0]!!!\n";
-}
 std::string Text(const char* path) {
   return ReadFile(path).value_or("-");
 }
-// Region is the |length| bytes of the fake EEPROM at |offset|.
 std::string Region(std::uint32_t offset, std::uint32_t length) {
   return {&g_image[offset], &g_image[offset + length]};
 }
 // State sums up what a regeneration left: store key and EEPROM digest (set
 // or -), the sizes of keymgr.cs and the three key files, and the TPM keys.
 std::string State() {
-  auto stored = [](std::uint32_t offset, std::uint32_t length) {
-    return Region(offset, length) == std::string(length, '\xFF') ? "- " : "set ";
-  };
-  std::string s = stored(kStoreKeyOffset, kStoreKeyLength);
-  s += stored(kScDigestOffset, kScDigestLength);
+  std::string s;
+  for (auto [offset, length] :
+       {std::pair{kStoreKeyOffset, kStoreKeyLength}, {kScDigestOffset, kScDigestLength}}) {
+    s += Region(offset, length) == std::string(length, '\xFF') ? "- " : "set ";
+  }
   for (const char* path : {kScDigestPath, kKeyIdPath, kKeyPwdPath, kStoredOokPath}) {
     std::error_code error;
-    auto size = fs::file_size(path, error);
+    const auto size = fs::file_size(path, error);
     s += error ? "- " : std::to_string(size) + " ";
   }
   return s + std::to_string(KeyManager().keys.size());
@@ -156,6 +147,11 @@ TEST(KmmFlow, RegenerationIsProvedAtBoot) {
                 "SC Digest Test Success [EEPROM]!!\nSC Digest Test Success [HDD]!!\n\n" +
                 kLine + "\n End KMM : T\n" + kLine + "\n\n\n\n");
   EXPECT_EQ(Text(kBootLogPath), "-");
+  // Another option is rejected, and the context is zeroed all the same.
+  const auto* bytes = reinterpret_cast<const std::uint8_t*>(g_context);
+  EXPECT_EQ(Call(2), "Key manage option invalid(2)!!\n");
+  EXPECT_EQ(g_context, nullptr);
+  EXPECT_TRUE(std::all_of(bytes, bytes + sizeof(KeyContext), [](auto b) { return b == 0; }));
 }
 
 TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
@@ -166,17 +162,22 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
   const std::string kRead =
       "Read Error [-5] - Store Key from EEPROM !!!\nRead Store Key error [Retry:";
   const std::string kValues = "Read Store Key but values are error [Retry:";
-  auto crypto = [](int call, int at, std::uint32_t code, std::uint32_t length = 0) {
+  const auto retries = [](const std::string& line) {
+    return line + "2]!!!\n" + line + "1]!!!\n" + line + "0]!!!\n";
+  };
+  const auto crypto = [](int call, int at, std::uint32_t code, std::uint32_t length = 0) {
     return [=] { g_fault = {call, at, code, length}; };
   };
-  auto part = [](std::uint32_t begin, std::uint32_t end, int count) {
+  const auto part = [](std::uint32_t begin, std::uint32_t end, int count) {
     return [=] { Eeprom().fault = {begin, end, count}; };
   };
-  auto pcp = [](PcpOp op, unsigned calls = 1) { return [=] { KeyManager().fail[op] = calls; }; };
+  const auto pcp = [](PcpOp op, unsigned calls = 1) {
+    return [=] { KeyManager().fail[op] = calls; };
+  };
   const std::uint32_t kDigestEnd = kScDigestOffset + kScDigestLength;
-  const std::uint32_t kStoreKeyLast = kStoreKeyOffset + kStoreKeyLength - 1;
-  // What a regeneration leaves (see State): nothing, the digest, or also the key files.
-  // A key whose identity never reached the disk is evicted again.
+  const std::uint32_t kLast = kStoreKeyOffset + kStoreKeyLength - 1;
+  // What a regeneration leaves (see State): nothing, the digest, or also the
+  // key files. A key whose identity never reached the disk is evicted again.
   const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
   const std::string kFiles = "- set 32 20 20 284 1";
   struct Row {
@@ -187,47 +188,28 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
     std::string after;  // State() after a regeneration, the boot status log after a boot
   } rows[] = {
       // clang-format off
-      {"no container for the secret key", 3, crypto(kCreate, 1, 0),
-       "Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {"secret key hash fails", 3, crypto(kHash, 1, 0xD7C00007),
-       "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
-      {"secret key hash of 33 bytes", 3, crypto(kHash, 1, 0, 33),
-       "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {"no container for the digest", 3, crypto(kCreate, 2, 0),
-       "Failed. nRes=0x00000000\n" + kDigest, kNone},
-      {"digest not written to EEPROM", 3, part(kScDigestOffset, kDigestEnd, 1),
-       "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
-      // A draw that fails stops the regeneration: nothing is sealed under
-      // the built-in initial one-off key, a previous identity or zeros.
-      {"one-off key not drawn", 3, pcp(kRandom),
-       "Failed to generate one_off_key by TPM.\n" + kStore, kDigestOnly},
-      {"password not drawn", 3, pcp(kRandom, 0b100),
-       "name_hex.\nFailed to generate user_pass_hex.\n" + kStore, kDigestOnly},
-      {"TPM key not created", 3, pcp(kCreateKey),
-       "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
-      {"one-off key not sealed", 3, pcp(kEncrypt),
-       "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
-      {"identity file not replaced", 3, [] { fs::create_directory(kKeyIdPath); },
-       "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
-      {"password file not replaced", 3, [] { fs::create_directory(kKeyPwdPath); },
-       "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
-      {"no container for sealing", 3, crypto(kCreate, 3, 0),
-       "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
-      {"sealing gives 32 bytes", 3, crypto(kAesProcess, 1, 0, 32),
-       "ook\nDTC_AES Failed.\n" + kStore, kFiles},
-      {"store key not written", 3, part(kStoreKeyLast, kStoreKeyLast + 1, 1),
-       "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
-      {"store key read once in vain", 1, part(kStoreKeyLast, kStoreKeyLast + 1, 1),
-       kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
-      {"store key never read", 1, part(kStoreKeyOffset, kStoreKeyOffset + 1, 3),
-       Retries(kRead) + kFail, "DT=FAIL\n"},
-      {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); },
-       Retries(kValues) + "Normal Boot", "-"},
+      {"no container for the secret key", 3, crypto(kCreate, 1, 0), "Failed. nRes=0x00000000\n" + kSecret, kNone},
+      {"secret key hash fails", 3, crypto(kHash, 1, 0xD7C00007), "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
+      {"secret key hash of 33 bytes", 3, crypto(kHash, 1, 0, 33), "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
+      {"no container for the digest", 3, crypto(kCreate, 2, 0), "Failed. nRes=0x00000000\n" + kDigest, kNone},
+      {"digest not written to EEPROM", 3, part(kScDigestOffset, kDigestEnd, 1), "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
+      // A draw that fails stops the regeneration: nothing is sealed under the
+      // built-in initial one-off key, a previous identity or zeros.
+      {"one-off key not drawn", 3, pcp(kRandom), "Failed to generate one_off_key by TPM.\n" + kStore, kDigestOnly},
+      {"password not drawn", 3, pcp(kRandom, 0b100), "name_hex.\nFailed to generate user_pass_hex.\n" + kStore, kDigestOnly},
+      {"TPM key not created", 3, pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
+      {"one-off key not sealed", 3, pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
+      {"identity file not replaced", 3, [] { fs::create_directory(kKeyIdPath); }, "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
+      {"password file not replaced", 3, [] { fs::create_directory(kKeyPwdPath); }, "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
+      {"no container for sealing", 3, crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
+      {"sealing gives 32 bytes", 3, crypto(kAesProcess, 1, 0, 32), "ook\nDTC_AES Failed.\n" + kStore, kFiles},
+      {"store key not written", 3, part(kLast, kLast + 1, 1), "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
+      {"store key read once in vain", 1, part(kLast, kLast + 1, 1), kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
+      {"store key never read", 1, part(kStoreKeyOffset, kStoreKeyOffset + 1, 3), retries(kRead) + kFail, "DT=FAIL\n"},
+      {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); }, retries(kValues) + "Normal Boot", "-"},
       {"one-off key not unsealed", 1, pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
-      {"no container for unsealing", 1, crypto(kCreate, 1, 0),
-       "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
-      {"unsealing gives 47 bytes", 1, crypto(kAesProcess, 1, 0, 47),
-       "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
+      {"no container for unsealing", 1, crypto(kCreate, 1, 0), "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
+      {"unsealing gives 47 bytes", 1, crypto(kAesProcess, 1, 0, 47), "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
       // clang-format on
   };
   ASSERT_GE(KmmSeedRandom(), 0);  // as a host does, so no row's draw goes to seeding
@@ -239,7 +221,8 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
       g_calls = {};
     }
     row.arm();
-    std::string out = Call(row.option, row.after != "-");  // a boot expecting no log: logFlag 0
+    const std::string out =
+        Call(row.option, row.after != "-");  // a boot expecting no log: logFlag 0
     EXPECT_NE(out.find(row.out), std::string::npos) << out;
     EXPECT_EQ(g_context == nullptr, out.ends_with("Error!!\n"));  // every failure ends so
     EXPECT_EQ(row.option == KMM_OPTION_REGENERATE ? State() : Text(kBootLogPath), row.after);
@@ -280,15 +263,6 @@ TEST(KmmFlow, SeedKeyIsUnguessableWhetherOrNotTheHostSeeds) {
       EXPECT_EQ(ProtectedKey_ByteAt(&g_context->seedKeyPK, at) & 0x80, 0) << at;
     }
   }
-}
-
-TEST(KmmFlow, OtherOptionsAreRejectedWithAZeroedContext) {
-  Reset();
-  ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
-  const auto* bytes = reinterpret_cast<const std::uint8_t*>(g_context);
-  EXPECT_EQ(Call(2), "Key manage option invalid(2)!!\n");
-  EXPECT_EQ(g_context, nullptr);
-  EXPECT_TRUE(std::all_of(bytes, bytes + sizeof(KeyContext), [](auto b) { return b == 0; }));
 }
 
 }  // namespace

@@ -4,6 +4,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <gtest/gtest.h>
+
 #include <csignal>
 
 #include <algorithm>
@@ -40,20 +42,9 @@ void ResetSandbox() {
   fs::create_directories(InRoot("/quorvan/spool/log"));
 }
 
-void WriteFile(const std::string& path, std::string_view bytes) {
-  fs::create_directories(fs::path(path).parent_path());
-  if (!std::ofstream(path, std::ios::binary).write(bytes.data(), std::ssize(bytes))) {
-    throw std::runtime_error("cannot write " + path);
-  }
-}
-
-std::optional<std::string> ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return in ? std::optional(std::string(std::istreambuf_iterator<char>(in), {})) : std::nullopt;
-}
-
-bool Exists(const std::string& path) {
-  return fs::exists(path);
+void ResetDevice(std::uint8_t control, std::uint32_t sfeConf) {
+  ResetSandbox();
+  MakeEeprom(control, sfeConf);
 }
 
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf) {
@@ -74,10 +65,16 @@ void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& byt
   WriteFile(KEYMGR_EEPROM_PATH, image.replace(offset, bytes.size(), {bytes.begin(), bytes.end()}));
 }
 
+const std::vector<std::string> kEmulator{KEYMGR_TEST_EMULATOR};
+
+bool UnderEmulator() {
+  return !kEmulator.empty();
+}
+
 // Emulated puts the emulator of a cross build in front of the first argument
 // that is a program of this build, also behind a launcher such as strace.
 std::vector<std::string> Emulated(std::vector<std::string> argv) {
-  static const std::vector<std::string> emulator{KEYMGR_TEST_EMULATOR};
+  const std::vector<std::string>& emulator = kEmulator;
   const auto built = std::find_if(argv.begin(), argv.end(), [](const std::string& arg) {
     return arg.starts_with(KEYMGR_TEST_BINARY_DIR "/");
   });
@@ -97,7 +94,8 @@ RunResult Run(const std::vector<std::string>& argv) {
   }
   const int wstatus = std::system((command + " </dev/null >" + out + " 2>" + err).c_str());
   RunResult result{WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : -1, *ReadFile(out), *ReadFile(err)};
-  fs::remove(out), fs::remove(err);
+  fs::remove(out);
+  fs::remove(err);
   return result;
 }
 
@@ -143,7 +141,9 @@ bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>&
   const pid_t strace = fork();
   if (strace == 0) {
     const int null = open("/dev/null", O_RDWR);
-    dup2(null, 0), dup2(null, 1), dup2(null, 2);
+    for (int fd : {0, 1, 2}) {
+      dup2(null, fd);
+    }
     std::vector<char*> raw;
     for (const auto& arg : args) {
       raw.push_back(const_cast<char*>(arg.c_str()));
@@ -199,12 +199,29 @@ std::string SyncTrace(const std::vector<std::string>& argv) {
   return summary;
 }
 
-std::string Hex(std::string_view bytes) {
-  std::string text;
-  for (unsigned char c : bytes) {
-    text += {"0123456789ABCDEF"[c >> 4], "0123456789ABCDEF"[c & 0x0F], ' '};
+std::string Output(const std::function<void()>& call) {
+  testing::internal::CaptureStdout();
+  call();
+  return testing::internal::GetCapturedStdout();
+}
+
+std::set<std::string> PersistentHandles(const std::string& tcti) {
+  const RunResult r =
+      Run({"tpm2_getcap", "handles-persistent", "-T", tcti.empty() ? KEYMGR_TCTI : tcti});
+  static const std::regex kHandle("0x8[0-9a-fA-F]{7}");
+  std::set<std::string> handles;
+  for (std::sregex_iterator it(r.out.begin(), r.out.end(), kHandle), end; it != end; ++it) {
+    handles.insert(it->str());
   }
-  return text;
+  return handles;
+}
+
+void EvictAllBut(const std::set<std::string>& keep, const std::string& tcti) {
+  for (const std::string& handle : PersistentHandles(tcti)) {
+    if (keep.count(handle) == 0) {
+      Run({"tpm2_evictcontrol", "-C", "o", "-c", handle, "-T", tcti.empty() ? KEYMGR_TCTI : tcti});
+    }
+  }
 }
 
 }  // namespace keymgr::test

@@ -1,12 +1,15 @@
-// Helpers shared by the tests: the sandbox root, files, EEPROM images and
-// running the built programs.
+// Helpers shared by the tests: the sandbox root, EEPROM images, the TPM's
+// persistent handles, captured output and running the built programs.
 #pragma once
 
 #include <cstdint>
-#include <optional>
+#include <functional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include "support/files.h"
 
 namespace keymgr::test {
 
@@ -17,10 +20,8 @@ std::string InRoot(std::string_view path);
 // ResetSandbox removes everything under the root except "run" (the swtpm of
 // the suite) and creates /quorvan/hidden and /quorvan/spool/log again.
 void ResetSandbox();
-
-void WriteFile(const std::string& path, std::string_view bytes);
-std::optional<std::string> ReadFile(const std::string& path);
-bool Exists(const std::string& path);
+// ResetDevice is ResetSandbox and a blank EEPROM made by MakeEeprom.
+void ResetDevice(std::uint8_t control, std::uint32_t sfeConf);
 
 // MakeEeprom writes a blank (0xFF) image at KEYMGR_EEPROM_PATH with the given
 // control byte and SFE CONF word (least significant byte first).
@@ -32,6 +33,10 @@ struct RunResult {
   int status = -1;  // exit status, or -1 when the program did not exit normally
   std::string out, err;
 };
+
+// UnderEmulator tells whether the build's programs run under an emulator
+// (a cross build under qemu-user).
+bool UnderEmulator();
 
 // Run starts argv[0] with the arguments, stdin on /dev/null, and waits.
 RunResult Run(const std::vector<std::string>& argv);
@@ -51,7 +56,13 @@ bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>&
 // rename onto |name|.
 std::string SyncTrace(const std::vector<std::string>& argv);
 
-// Hex renders bytes as upper-case "%02X " groups, the way the programs print.
-std::string Hex(std::string_view bytes);
+// Output runs |call| and returns what it printed on standard output.
+std::string Output(const std::function<void()>& call);
+
+// PersistentHandles lists the persistent handles of the TPM at |tcti| (the
+// suite's swtpm by default), as tpm2_getcap sees them. EvictAllBut evicts
+// every one that is not in |keep|.
+std::set<std::string> PersistentHandles(const std::string& tcti = "");
+void EvictAllBut(const std::set<std::string>& keep, const std::string& tcti = "");
 
 }  // namespace keymgr::test

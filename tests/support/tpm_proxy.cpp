@@ -5,7 +5,7 @@
 #include <unistd.h>
 
 #include <array>
-#include <cstring>
+#include <utility>
 
 namespace keymgr::test {
 
@@ -22,42 +22,41 @@ int UnixSocket(const std::string& path, bool listening) {
   const auto* at = reinterpret_cast<const sockaddr*>(&address);
   if (listening) {
     unlink(path.c_str());
-    if (bind(fd, at, sizeof(address)) == 0 && listen(fd, 16) == 0) {
-      return fd;
-    }
-  } else if (connect(fd, at, sizeof(address)) == 0) {
+  }
+  if (listening ? bind(fd, at, sizeof(address)) == 0 && listen(fd, 16) == 0
+                : connect(fd, at, sizeof(address)) == 0) {
     return fd;
   }
   close(fd);
   return -1;
 }
 
-std::uint32_t Big(const std::uint8_t* p) {
-  return std::uint32_t{p[0]} << 24 | std::uint32_t{p[1]} << 16 | std::uint32_t{p[2]} << 8 | p[3];
+std::uint32_t Big(const char* p) {
+  const auto* u = reinterpret_cast<const unsigned char*>(p);
+  return std::uint32_t{u[0]} << 24 | std::uint32_t{u[1]} << 16 | std::uint32_t{u[2]} << 8 | u[3];
 }
 
-// ReadMessage reads one command or response whole into |message|.
-bool ReadMessage(int fd, std::array<std::uint8_t, 4096>& message, std::size_t* size) {
+// ReadMessage reads one command or response whole.
+bool ReadMessage(int fd, std::string& message) {
+  std::array<char, 4096> buffer{};
   std::size_t have = 0;
   for (std::size_t want = kHeaderSize; have < want;) {
-    const ssize_t got = read(fd, message.data() + have, want - have);
+    const ssize_t got = read(fd, buffer.data() + have, want - have);
     if (got <= 0) {
       return false;
     }
     have += static_cast<std::size_t>(got);
-    if (have == kHeaderSize) {
-      want = Big(message.data() + 2);
-      if (want < kHeaderSize || want > message.size()) {
-        return false;
-      }
+    if (have == kHeaderSize && ((want = Big(buffer.data() + 2)) < kHeaderSize || want > 4096)) {
+      return false;
     }
   }
-  *size = have;
+  message.assign(buffer.data(), have);
   return true;
 }
 
-bool WriteAll(int fd, const std::uint8_t* bytes, std::size_t size) {
-  return send(fd, bytes, size, MSG_NOSIGNAL) == static_cast<ssize_t>(size);
+bool WriteMessage(int fd, const std::string& message) {
+  return send(fd, message.data(), message.size(), MSG_NOSIGNAL) ==
+         static_cast<ssize_t>(message.size());
 }
 
 }  // namespace
@@ -71,71 +70,75 @@ TpmProxy::~TpmProxy() {
   shutdown(listener_, SHUT_RDWR);
   thread_.join();
   close(listener_);
-  if (held_ >= 0) {
-    close(held_);
-  }
+  close(held_);
 }
 
 void TpmProxy::Arm(Fault fault, int nth, std::uint32_t code) {
-  std::lock_guard<std::mutex> guard(lock_);
+  const std::lock_guard<std::mutex> guard(lock_);
   fault_ = fault;
   nth_ = nth;
   code_ = code;
-  seen_ = 0;
+  sent_.clear();
+  traffic_.clear();
+}
+
+std::vector<TpmProxy::Command> TpmProxy::Sent() {
+  const std::lock_guard<std::mutex> guard(lock_);
+  return sent_;
+}
+
+std::string TpmProxy::Traffic() {
+  const std::lock_guard<std::mutex> guard(lock_);
+  return traffic_;
 }
 
 void TpmProxy::Serve() {
   for (int client; (client = accept(listener_, nullptr, nullptr)) >= 0;) {
-    if (held_ >= 0) {
-      close(held_);
-      held_ = -1;
-    }
+    close(std::exchange(held_, -1));
     Relay(client);
   }
 }
 
 // Relay passes the commands of one connection on, one at a time.
 void TpmProxy::Relay(int client) {
-  std::array<std::uint8_t, 4096> message{};
-  std::size_t size = 0;
-  while (ReadMessage(client, message, &size)) {
-    const std::uint32_t code = Big(message.data() + 6);
-    if (log_ != nullptr) {
-      std::fprintf(log_, "%03X %08X\n", code, size >= 14 ? Big(message.data() + 10) : 0);
-      std::fflush(log_);
-    }
+  std::string message;
+  while (ReadMessage(client, message)) {
+    const Command command{Big(&message[6]), message.size() >= 14 ? Big(&message[10]) : 0};
     Fault fault = Fault::kNone;
     {
-      std::lock_guard<std::mutex> guard(lock_);
-      const int nth = ++seen_;
-      if ((nth_ != 0 && nth == nth_) || (nth_ == 0 && code == code_)) {
-        fault = fault_;
-      }
+      const std::lock_guard<std::mutex> guard(lock_);
+      sent_.push_back(command);
+      traffic_ += message;
+      const bool hit = nth_ != 0 ? static_cast<int>(sent_.size()) == nth_ : command.code == code_;
+      fault = hit ? fault_ : Fault::kNone;
+    }
+    if (log_ != nullptr) {
+      std::fprintf(log_, "%03X %08X\n", command.code, command.handle);
+      std::fflush(log_);
     }
     if (fault == Fault::kHangUp) {
       break;
     }
     if (fault == Fault::kError) {
-      const std::uint8_t failed[kHeaderSize] = {
-          0x80, 0x01, 0, 0, 0, kHeaderSize, 0, 0, kFailure >> 8, kFailure & 0xFF};
-      if (!WriteAll(client, failed, sizeof(failed))) {
+      const char failed[] = {'\x80', 1, 0, 0, 0, kHeaderSize, 0, 0, kFailure >> 8, kFailure & 0xFF};
+      if (!WriteMessage(client, std::string(failed, sizeof(failed)))) {
         break;
       }
       continue;
     }
     const int server = UnixSocket(upstream_, false);
-    const bool answered = server >= 0 && WriteAll(server, message.data(), size) &&
-                          ReadMessage(server, message, &size);
-    if (server >= 0) {
-      close(server);
-    }
+    const bool answered =
+        server >= 0 && WriteMessage(server, message) && ReadMessage(server, message);
+    close(server);
     if (fault == Fault::kWithhold) {
       held_ = client;
       return;
     }
-    if (!answered || !WriteAll(client, message.data(), size)) {
+    if (!answered || !WriteMessage(client, message)) {
       break;
     }
+    const std::lock_guard<std::mutex> guard(lock_);
+    traffic_ += message;
   }
   close(client);
 }

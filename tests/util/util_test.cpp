@@ -1,18 +1,14 @@
 #include <gtest/gtest.h>
 
-#include <functional>
 #include <numeric>
 #include <string>
 
+#include "support/sandbox.h"
 #include "util/bytes.h"
 
 namespace {
 
-std::string Output(const std::function<void()>& call) {
-  testing::internal::CaptureStdout();
-  call();
-  return testing::internal::GetCapturedStdout();
-}
+using keymgr::test::Output;
 
 // BytesToHex's failures leave the destination untouched. Its capacity is
 // 8-bit, so 128 bytes or more can never fit.
@@ -21,8 +17,12 @@ TEST(BytesTest, PrintersAndHex) {
   std::iota(b, b + 256, 0);
   EXPECT_EQ(
       Output([&] {
-        PrintHexDump(b, 0, 1), PrintHexDump(b, 9, 0), PrintHexDump(b, 20, 1);
-        PrintArray(b + 10, 2), PrintArray(b, -3), PrintRedactedArray(2);
+        PrintHexDump(b, 0, 1);
+        PrintHexDump(b, 9, 0);
+        PrintHexDump(b, 20, 1);
+        PrintArray(b + 10, 2);
+        PrintArray(b, -3);
+        PrintRedactedArray(2);
       }),
       "\n00 01 02 03 04 05 06 07 08 \n"
       "00 01 02 03 04 05 06 07   08 09 0A 0B 0C 0D 0E 0F \n10 11 12 13 \n"
@@ -31,12 +31,18 @@ TEST(BytesTest, PrintersAndHex) {
   char dst[256] = "Q";
   const std::string kNull = "ERR: Null pointer detecter or zero length\n";
   const std::string kShort = "ERR: to short destination buffer";
-  const auto fails = [&](const std::uint8_t* src, int n, char* to, int size, std::string out) {
+  const struct {
+    const std::uint8_t* src;
+    int n;
+    char* to;
+    int size;
+    const std::string& out;
+  } fails[] = {{nullptr, 2, dst, 5, kNull}, {b, 0, dst, 5, kNull},  {b, 2, nullptr, 5, kNull},
+               {b, 2, dst, 0, kNull},       {b, 2, dst, 4, kShort}, {b, 128, dst, 255, kShort}};
+  for (const auto& [src, n, to, size, out] : fails) {
     EXPECT_EQ(Output([&] { EXPECT_EQ(BytesToHex(src, n, to, size), -1); }), out) << n << size;
     EXPECT_STREQ(dst, "Q");
-  };
-  fails(nullptr, 2, dst, 5, kNull), fails(b, 0, dst, 5, kNull), fails(b, 2, nullptr, 5, kNull);
-  fails(b, 2, dst, 0, kNull), fails(b, 2, dst, 4, kShort), fails(b, 128, dst, 255, kShort);
+  }
   dst[255] = 'Q';
   EXPECT_EQ(Output([&] { EXPECT_EQ(BytesToHex(b + 128, 127, dst, 255), 0); }), "");
   EXPECT_EQ(std::string(dst, 4) + std::string(dst + 250, 6), std::string("8081FDFE\0Q", 10));

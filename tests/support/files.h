@@ -1,0 +1,24 @@
+// Files and bytes, for the tests and the fuzz harnesses alike.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace keymgr::test {
+
+// WriteFile creates the folders above |path| and writes |bytes| there.
+void WriteFile(const std::string& path, std::string_view bytes);
+std::optional<std::string> ReadFile(const std::string& path);
+
+// Sha256 is the digest of |bytes| by OpenSSL's one-shot call, which none of
+// the code under test uses.
+std::string Sha256(std::string_view bytes);
+
+// Require ends the process when |holds| is false: a fuzz harness's check.
+void Require(bool holds);
+
+// Hex renders bytes as upper-case "%02X " groups, the way the programs print.
+std::string Hex(std::string_view bytes);
+
+}  // namespace keymgr::test
