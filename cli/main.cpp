@@ -43,8 +43,8 @@ int main(int argc, char** argv) {
   const keymgr::cli::Command command = keymgr::cli::ParseCommand(argc, argv);
   switch (command.action) {
     case Action::kHash:
-      (void)HashManifest();
-      return Finish(0);
+      // Only a signed build's refusal fails the command.
+      return Finish(HashManifest() == 2 ? 1 : 0);
     case Action::kFile:
       VerifyManifestFile(command.path);
       return Finish(0);

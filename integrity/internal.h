@@ -11,27 +11,42 @@
 #include <cstdio>
 
 #include "crypto/file_digest.h"
+#include "integrity/manifest.h"
+#include "util/owned.h"
 #include "util/paths.h"
 
 namespace keymgr::integrity {
 
 using Digest = std::array<std::uint8_t, kFileDigestSize>;
-using EntryBuffer = std::array<char, kPathBufferSize>;
+#if KEYMGR_SIGNED_BUILD
+// SignedFiles holds the bytes that keymgr.sig covers, read once. Check reads
+// the digest file and the manifest whole, checks keymgr.sig against them and
+// the built-in key, and puts streams over the bytes it checked in the files'
+// place, so that a file swapped after the check changes nothing. It prints
+// the signature error line and returns false when the check fails, and the
+// release counter with |verbose|.
+class SignedFiles {
+ public:
+  bool Check(File& digests, File& manifest, bool verbose);
+  static void Free(std::uint8_t* bytes);
 
-enum class EntryRead {
-  kEntry,
-  kEnd,
-  kTooLong,    // does not fit the path buffer
-  kNul,        // holds a NUL byte, which would cut the path short
-  kReadError,  // the manifest could not be read on
+ private:
+  Owned<std::uint8_t*, Free> digests_, manifest_;
 };
-
-// ReadEntry reads the next white-space separated manifest entry into |entry|,
-// which the caller zeroes. An entry that does not fit the path buffer is
-// consumed to its end and returned as too long. Too long, one with a NUL
-// byte and a read error each fail a run; none is taken for the end of the
-// manifest. Nothing is printed: entries may be read ahead of their turn.
-EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry);
+inline bool CheckSigned(SignedFiles& held, File& digests, File& manifest, bool verbose) {
+  return held.Check(digests, manifest, verbose);
+}
+// kHashRefused is HashManifest's result in a signed build: digest files are
+// made and signed on the build host.
+inline constexpr int kHashRefused = 2;
+#else
+// Without a built-in key the files are taken as they are.
+struct SignedFiles {};
+inline bool CheckSigned(SignedFiles& /*held*/, File& /*digests*/, File& /*manifest*/,
+                        bool /*verbose*/) {
+  return true;
+}
+#endif
 
 // A manifest entry with its file hashed, or with why it could not be.
 struct HashedEntry {

@@ -2,8 +2,35 @@
 // and checking the whole list at boot.
 #pragma once
 
+#include <array>
+#include <cstdio>
+
+#include "util/paths.h"
+
+namespace keymgr::integrity {
+
+using EntryBuffer = std::array<char, kPathBufferSize>;
+
+enum class EntryRead {
+  kEntry,
+  kEnd,
+  kTooLong,    // does not fit the path buffer
+  kNul,        // holds a NUL byte, which would cut the path short
+  kReadError,  // the manifest could not be read on
+};
+
+// ReadEntry reads the next white-space separated manifest entry into |entry|,
+// which the caller zeroes. An entry that does not fit the path buffer is
+// consumed to its end and returned as too long. Too long, one with a NUL
+// byte and a read error each fail a run; none is taken for the end of the
+// manifest. Nothing is printed: entries may be read ahead of their turn.
+EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry);
+
+}  // namespace keymgr::integrity
+
 // HashManifest rewrites the digest file from the files the manifest lists.
-// Returns 1 when either file could not be opened, else 0.
+// Returns 1 when either file could not be opened, else 0; in a signed build
+// it refuses with a line and returns 2, leaving the digest file as it was.
 int HashManifest();
 
 // VerifyManifestFile checks the first manifest entry equal to |path| and

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -38,13 +39,49 @@ std::vector<std::string> EioOn(const std::string& path, const std::string& progr
       {program});
 }
 
+// SwapAt runs |argv| (traced, holding its open of |held|) and meanwhile,
+// once that open is under way, alters |file| to "x" and puts |digests|.x in
+// the digest file's place.
+std::vector<std::string> SwapAt(const std::string& held, const std::string& file,
+                                const std::string& digests, const std::vector<std::string>& argv) {
+  std::vector<std::string> args = {
+      "sh",
+      "-c",
+      R"((until grep -q "$1" "$4" 2>/dev/null; do sleep 0.05; done; printf x >"$2"; cat "$3.x" >"$3") & shift 4; exec "$@")",
+      "sh",
+      held,
+      file,
+      digests,
+      t::InRoot("/trace")};
+  args.insert(args.end(), argv.begin(), argv.end());
+  return args;
+}
+
 // Every run starts from a (empty), b, and c, a link to a file whose path has
 // 99 characters (the most an entry may hold), listed with mixed white space,
 // b twice; their records followed by bytes never read; a log left by an
-// earlier boot; and an EEPROM whose control byte alone opens the gate.
+// earlier boot; and an EEPROM whose control byte alone opens the gate. The
+// signed build's runs (keymgr-signed, the test key built in) start from a
+// digest file and keymgr.sig that keymgr-mkdigest made, with release 42.
 TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
-  const std::string K = KEYMGR_TEST_KEYMGR_BIN, E = t::Sha256(""), B = t::Sha256("b"),
-                    Z = t::Sha256("z");
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN, S = KEYMGR_TEST_SIGNED_BIN, E = t::Sha256(""),
+                    B = t::Sha256("b"), Z = t::Sha256("z"), X = t::Sha256("x");
+  const std::string sig = keymgr::kSignaturePath, data = KEYMGR_TEST_SOURCE_DIR "/tests/cli/data/";
+  const auto sign = [&](const std::string& key) {
+    t::Run({KEYMGR_TEST_MKDIGEST_BIN, "--root", "/", "--manifest", kManifest, "--output", kDigests,
+            "--key", data + key, "--counter", "42"});
+  };
+  // Bytes |at| of keymgr.sig made |byte|, and the file signed again with
+  // the test key.
+  const auto resign = [&](std::size_t at, char byte) {
+    std::string file = *t::ReadFile(sig);
+    file[at] = byte;
+    t::WriteFile(t::InRoot("/body"), file.substr(0, 88));
+    t::Run({"openssl", "pkeyutl", "-sign", "-rawin", "-inkey", data + "digest_key.pem", "-in",
+            t::InRoot("/body"), "-out", t::InRoot("/signature")});
+    t::WriteFile(sig, file.substr(0, 88) + *t::ReadFile(t::InRoot("/signature")));
+  };
+  const std::string badSig = sig + " signature error!!!\n";
   const std::string l99 = t::InRoot("/" + std::string(98 - t::Root().size(), 'z'));
   const std::string pass = kOff + "BN=OK\n", fail = "BN=FAIL\n", records = E + B + B + Z;
   const std::string first3 = kOff + Block(a, E, E) + Block(b, B, B) + Block(b, B, B);
@@ -65,7 +102,6 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
       {"SFE_003 alone opens the gate", {K, "has"}, kOn + "BN=OK\n", [] { t::MakeEeprom(0x00, 4); }},
       {"mode 3 keeps the gate closed", {K}, kOff, [] { t::MakeEeprom(0x43, 0xFFFFFFFB); }},
       {"the enable bit missing", {K, "log"}, kOff, [] { t::MakeEeprom(0x02, 0); }},
-      {"no EEPROM image", {K}, "Read Error [-2] - SFE CONF from EEPROM !!!\n", Put(KEYMGR_EEPROM_PATH)},
       {"version by prefix", {K, "-vx"}, "Version: 2.3\n"},
       {"file without a path", {K, "file"}, ""},
       {"file by prefix", {K, "filecheck", b, "x"}, Block(b, B, B), Put(kDigests, E + B + t::Sha256("x"))},
@@ -80,8 +116,6 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
       {"a missing entry", {K}, kOff + "file[" + b + "] status error!!\n" + fail, Put(b)},
       {"a short digest file", {K, "log"}, first3 + Block(c, Z, std::string(32, '\0')) + fail, Put(kDigests, E + B + B)},
       {"an empty manifest", {K}, pass, Put(kManifest, " \n\t")},
-      {"no digest file", {K, "log"}, kOff + kDigests + " open error!!!\n" + fail, Put(kDigests), 1},
-      {"no manifest", {K}, kOff + kManifest + " open error!!!\n" + fail, Put(kManifest), 1},
       {"an entry too long", {K}, kOff + tooLong + fail, Put(kManifest, l99 + "z")},
       {"a FIFO listed", {K}, aOpen, [] { fs::remove(a); mkfifo(a.c_str(), 0600); }},
       {"a file of 2 GiB", {K}, aOpen, [] { fs::resize_file(a, 1ULL << 31); }},
@@ -90,9 +124,28 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
        Put(kManifest, a + std::string("\0x ", 3) + b)},
       {"a manifest that cannot be read", EioOn(kManifest, K), kOff + kManifest + " open error!!!\n" + fail, [] {}, 1},
       {"a digest file that cannot be read", EioOn(kDigests, K), kOff + kDigests + " open error!!!\n" + fail, [] {}, 1},
+      {"signed and checked", {S, "log"}, kOff + "release counter: 42\n" + first3.substr(kOff.size()) + Block(c, Z, Z) + "BN=OK\n"},
+      {"signed, a listed file altered", {S}, kOff + fail, Put(b, "x")},
+      {"signed, the digest file rebuilt unsigned", {S}, kOff + badSig + fail, [&] { t::WriteFile(b, "x"); t::Run({K, "hash"}); }, 1},
+      {"signed, no keymgr.sig", {S}, kOff + badSig + fail, Put(sig), 1},
+      {"signed, keymgr.sig empty", {S}, kOff + badSig + fail, Put(sig, ""), 1},
+      {"signed, keymgr.sig cut short", {S}, kOff + badSig + fail, [&] { fs::resize_file(sig, 151); }, 1},
+      {"signed, a bit flipped", {S}, kOff + badSig + fail, [&] { std::string f = *t::ReadFile(sig); f[120] ^= 1; t::WriteFile(sig, f); }, 1},
+      {"signed by another key", {S}, kOff + badSig + fail, [&] { sign("other_key.pem"); }, 1},
+      {"signed, another format version", {S}, kOff + badSig + fail, [&] { resign(7, 2); }, 1},
+      {"signed, the last entry dropped", {S}, kOff + badSig + fail, Put(kManifest, a + " " + b + " " + b), 1},
+      {"signed, two entries swapped", {S}, kOff + badSig + fail, Put(kManifest, b + " " + a + " " + b + " " + c), 1},
+      {"signed, an entry added", {S}, kOff + badSig + fail, Put(kManifest, a + " " + b + " " + b + " " + c + " " + a), 1},
+      {"signed, hash refused", {S, "hash"}, "hash is done on the build host in a signed build!!!\n", [] {}, 1},
+      {"signed, file checked", {S, "file", b}, Block(b, B, B)},
+      {"signed, file against a bad keymgr.sig", {S, "file", b}, badSig, Put(sig, "")},
+      // The files swapped while keymgr.sig is being opened: what is hashed
+      // against is what was checked.
+      {"signed, files swapped after the check", SwapAt(sig, b, kDigests, t::Traced({"-o", t::InRoot("/trace"), "-P", sig, "-e", "trace=openat", "-e", "inject=openat:delay_enter=2s"}, {S, "log"})),
+       kOff + "release counter: 42\n" + Block(a, E, E) + Block(b, X, B) + fail, [&] { t::WriteFile(kDigests + ".x", E + X + X + Z); }, 0, E + X + X + Z},
       // clang-format on
   };
-  const auto setUp = [&] {
+  const auto setUp = [&](const Case& k) {
     t::ResetDevice(0x42, 0);
     t::WriteFile(a, "");
     t::WriteFile(b, "b");
@@ -101,10 +154,13 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
     t::WriteFile(kManifest, a + " \t" + b + "\n\n" + b + "\t" + c + "\n");
     t::WriteFile(kDigests, records + "junk");
     t::WriteFile(kLog, "OLD\n");
+    if (k.args.back() != "hash" && std::find(k.args.begin(), k.args.end(), S) != k.args.end()) {
+      sign("digest_key.pem");
+    }
   };
   for (const Case& k : cases) {
     SCOPED_TRACE(k.name);
-    setUp();
+    setUp(k);
     k.change();
     const auto digests = t::ReadFile(kDigests);
     auto run = t::Run(k.args);
@@ -113,6 +169,59 @@ TEST(KeymgrTest, CommandsGateOutcomeAndExitStatus) {
     const auto bn = k.out.find("BN=");
     EXPECT_EQ(t::ReadFile(kLog), bn == std::string::npos ? "OLD\n" : k.out.substr(bn)) << k.out;
     EXPECT_EQ(t::ReadFile(kDigests), k.digests ? k.digests : digests) << k.out;
+  }
+}
+
+// keymgr-mkdigest makes what keymgr hash makes on the device: over a tree
+// seen at "/" (a link with an absolute target, ".." entries) the same bytes;
+// an entry it cannot hash (a folder, a missing file) is named, and nothing
+// is written. Inside an image root, absolute links and ".." stay in the
+// root. The same tree and key give the same keymgr.sig on every host: the
+// one below was made on x86-64, and the aarch64 suite makes it under
+// qemu-user; so does the Buildroot script.
+TEST(KeymgrTest, MkdigestMakesWhatHashMakesInsideTheImageRoot) {
+  const std::string K = KEYMGR_TEST_KEYMGR_BIN, M = KEYMGR_TEST_MKDIGEST_BIN, X = t::Sha256("x");
+  const std::string key = KEYMGR_TEST_SOURCE_DIR "/tests/cli/data/digest_key.pem";
+  t::ResetDevice(0x42, 0);
+  const std::string d = t::InRoot("/d");
+  t::WriteFile(d + "/a", "a");
+  t::WriteFile(d + "/sub/b", "b");
+  fs::create_symlink(d + "/a", d + "/l");
+  const std::string list = d + "/a " + d + "/sub/../sub/b " + d + "/l " + d + "/sub/../../d/a\n";
+  for (const std::string& extra : {std::string(), d + "/sub", d + "/gone"}) {
+    t::WriteFile(kManifest, list + extra);
+    t::Run({K, "hash"});
+    const std::string hashed = *t::ReadFile(kDigests);
+    t::WriteFile(kDigests, "OLD");
+    const auto made = t::Run({M, "--root", "/", "--manifest", kManifest, "--output", kDigests});
+    EXPECT_EQ(made.status, extra.empty() ? 0 : 1) << extra;
+    EXPECT_EQ(*t::ReadFile(kDigests), extra.empty() ? hashed : "OLD") << extra;
+    EXPECT_EQ(made.err.find(extra + ": cannot be hashed") != std::string::npos, !extra.empty())
+        << made.err;
+  }
+  const std::string root = t::InRoot("/image"), hidden = root + "/quorvan/hidden/";
+  t::WriteFile(root + "/etc/x", "x");
+  fs::create_symlink("/etc/x", root + "/etc/l");
+  fs::create_symlink("../../../etc/x", root + "/etc/up");
+  t::WriteFile(hidden + "keymgr.list", "/etc/l /etc/up /../etc/x\n");
+  std::vector<std::vector<std::string>> runs(2,
+                                             {M, "--root", root, "--key", key, "--counter", "7"});
+  if (!t::UnderEmulator()) {
+    runs.push_back({"env", "KEYMGR_MKDIGEST=" + M, "KEYMGR_DIGEST_KEY=" + key,
+                    "KEYMGR_RELEASE_COUNTER=7",
+                    KEYMGR_TEST_SOURCE_DIR "/dist/buildroot/keymgr-digest.sh", root});
+  }
+  for (const auto& run : runs) {
+    std::filesystem::remove(hidden + "keymgr.sig");
+    ASSERT_EQ(t::Run(run).status, 0) << run[0];
+    EXPECT_EQ(t::ReadFile(hidden + "keymgr.cb"), X + X + X);
+    EXPECT_EQ(
+        t::Hex(*t::ReadFile(hidden + "keymgr.sig")),
+        t::Hex(t::FromHex("4b4d534700000001e85ccff33f6ba91c0000000000000007a94e6fc76671dc7adc1689"
+                          "1d8d5363846aa7e3c5f13bd90cb3388ce149b41a6b335fa9f48894ed578d7c6676cfd0"
+                          "f1510752479cbd604daea1472a0363639702072c8e848c6e5212a325e9a9cdba94b26a"
+                          "d67af18613dd80afafae7b105ced93610409cfbd2adaf949f0f837007f407405df5685"
+                          "54815b2a416e02e05e361c0c")));
   }
 }
 

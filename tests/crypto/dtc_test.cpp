@@ -13,13 +13,7 @@ namespace {
 
 using Bytes = std::string;
 
-Bytes FromHex(const std::string& hex) {
-  Bytes out;
-  for (std::size_t i = 0; i + 1 < hex.size(); i += 2) {
-    out += static_cast<char>(std::stoi(hex.substr(i, 2), nullptr, 16));
-  }
-  return out;
-}
+using keymgr::test::FromHex;
 
 // A caller's array with a record attached and sized to |plain|.
 struct Slot {

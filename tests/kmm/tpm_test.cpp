@@ -76,7 +76,7 @@ std::string PasswordDigest(const std::string& pwd, bool asHex = false) {
 TEST(Tpm, FlowsCostLittleAndKeepSecretsOffTheBus) {
   auto keep = PersistentHandles();
   keep.erase("0x81000001");
-  for (const std::string transport :
+  for (const std::string& transport :
        {"swtpm:path=" + kProxy, "libtss2-tcti-swtpm.so.0:path=" + kProxy}) {
     for (bool srk : {false, true}) {
       SCOPED_TRACE(transport + (srk ? ", persistent SRK" : ""));

@@ -39,6 +39,14 @@ void Require(bool holds) {
   }
 }
 
+std::string FromHex(std::string_view hex) {
+  std::string bytes;
+  for (std::size_t i = 0; i + 1 < hex.size(); i += 2) {
+    bytes += static_cast<char>(std::stoi(std::string(hex.substr(i, 2)), nullptr, 16));
+  }
+  return bytes;
+}
+
 std::string Hex(std::string_view bytes) {
   std::string text;
   for (unsigned char c : bytes) {

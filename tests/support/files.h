@@ -18,6 +18,9 @@ std::string Sha256(std::string_view bytes);
 // Require ends the process when |holds| is false: a fuzz harness's check.
 void Require(bool holds);
 
+// FromHex gives the bytes that pairs of hex digits spell.
+std::string FromHex(std::string_view hex);
+
 // Hex renders bytes as upper-case "%02X " groups, the way the programs print.
 std::string Hex(std::string_view bytes);
 

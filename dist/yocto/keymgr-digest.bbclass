@@ -1,0 +1,24 @@
+# keymgr-digest.bbclass: makes and signs the digest file of an image's root
+# file system, so that a device with a signed keymgr build checks it at boot.
+# In an image recipe:
+#   inherit keymgr-digest
+#   KEYMGR_DIGEST_KEY = "/path/to/digest-key.pem"   (Ed25519 private key, PEM)
+#   KEYMGR_RELEASE_COUNTER = "42"
+# The image's /quorvan/hidden/keymgr.list names the protected files;
+# keymgr.cb and keymgr.sig are written beside it before the image is packed.
+# keymgr-mkdigest comes from keymgr-native.
+
+KEYMGR_DIGEST_KEY ??= ""
+KEYMGR_RELEASE_COUNTER ??= "0"
+KEYMGR_MKDIGEST ??= "keymgr-mkdigest"
+
+DEPENDS:append = " keymgr-native"
+ROOTFS_POSTPROCESS_COMMAND:append = " keymgr_digest_rootfs;"
+
+keymgr_digest_rootfs() {
+	if [ -z "${KEYMGR_DIGEST_KEY}" ]; then
+		bbfatal "keymgr-digest: set KEYMGR_DIGEST_KEY to the Ed25519 private key that signs"
+	fi
+	${KEYMGR_MKDIGEST} --root ${IMAGE_ROOTFS} --key ${KEYMGR_DIGEST_KEY} \
+		--counter ${KEYMGR_RELEASE_COUNTER}
+}

@@ -1,0 +1,93 @@
+// The check of keymgr.sig in a signed build (one with KEYMGR_DIGEST_PUBKEY).
+#include <cstdlib>
+#include <cstring>
+
+#include "integrity/internal.h"
+#include "integrity/signature.h"
+#include "keymgr_digest_key.h"
+#include "util/bytes.h"
+#include "util/debug_print.h"
+
+namespace keymgr::integrity {
+
+namespace {
+
+// The files are read whole, and one larger than this fails the check: a
+// manifest of ten thousand entries and its digest file are far smaller.
+constexpr std::size_t kMaxSignedFile = std::size_t{16} << 20;
+
+constexpr PublicKey ParseKey(const char (&hex)[65]) {
+  PublicKey key{};
+  for (std::size_t i = 0; i < key.size(); ++i) {
+    key[i] =
+        static_cast<std::uint8_t>(HexDigitValue(hex[2 * i]) << 4 | HexDigitValue(hex[2 * i + 1]));
+  }
+  return key;
+}
+constexpr PublicKey kDigestKey = ParseKey(KEYMGR_DIGEST_PUBKEY_HEX);
+
+// ReadWhole reads |stream| to its end into |bytes| and sets |size|.
+bool ReadWhole(std::FILE* stream, Owned<std::uint8_t*, SignedFiles::Free>& bytes,
+               std::size_t* size) {
+  std::size_t capacity = 0;
+  *size = 0;
+  for (;;) {
+    if (*size == capacity) {
+      capacity = capacity == 0 ? 4096 : 2 * capacity;
+      auto* grown = static_cast<std::uint8_t*>(
+          capacity <= kMaxSignedFile + 1 ? std::realloc(bytes.get(), capacity) : nullptr);
+      if (grown == nullptr) {
+        return false;
+      }
+      (void)bytes.release();
+      bytes.reset(grown);
+    }
+    const std::size_t got = std::fread(bytes.get() + *size, 1, capacity - *size, stream);
+    *size += got;
+    if (got == 0) {
+      return std::ferror(stream) == 0 && *size <= kMaxSignedFile;
+    }
+  }
+}
+
+// Over opens a stream that reads the |size| bytes at |bytes|.
+File Over(std::uint8_t* bytes, std::size_t size) {
+  return File(::fmemopen(bytes, size, "r"));
+}
+
+}  // namespace
+
+void SignedFiles::Free(std::uint8_t* bytes) {
+  std::free(bytes);
+}
+
+bool SignedFiles::Check(File& digests, File& manifest, bool verbose) {
+  // The files first, then the signature file: what is checked is what was
+  // read, whatever the files hold by the time the signature is.
+  std::size_t digestsSize = 0;
+  std::size_t manifestSize = 0;
+  bool ok = ReadWhole(digests.get(), digests_, &digestsSize) &&
+            ReadWhole(manifest.get(), manifest_, &manifestSize);
+  std::uint8_t signature[kSignatureFileSize + 1] = {};  // one more, to see a longer file
+  std::uint64_t counter = 0;
+  if (const File file = OpenFile(kSignaturePath, "r"); ok && file) {
+    const std::size_t size = std::fread(signature, 1, sizeof(signature), file.get());
+    ok = CheckSignatureFile({signature, size}, kDigestKey, {manifest_.get(), manifestSize},
+                            {digests_.get(), digestsSize}, &counter)
+             .ok();
+  } else {
+    ok = false;
+  }
+  if (!ok) {
+    DebugPrint("%s signature error!!!\n", kSignaturePath);
+    return false;
+  }
+  if (verbose) {
+    DebugPrint("release counter: %llu\n", static_cast<unsigned long long>(counter));
+  }
+  digests = Over(digests_.get(), digestsSize);
+  manifest = Over(manifest_.get(), manifestSize);
+  return digests && manifest;
+}
+
+}  // namespace keymgr::integrity
