@@ -9,6 +9,9 @@
 
 #include "bootlog/boot_status.h"
 #include "cli/command.h"
+#ifdef KEYMGR_MEASURE_PCR
+#include "cli/measure.h"
+#endif
 #include "integrity/manifest.h"
 #include "keymgr_build_config.h"
 #include "platform/eeprom.h"
@@ -60,8 +63,19 @@ int main(int argc, char** argv) {
   if (CheckSecurityFeature() != 0) {
     enabled = 1;
   }
+#ifdef KEYMGR_MEASURE_PCR
+  // One event a boot run: the verdict, or that nothing was verified.
+  using keymgr::tpm::Verdict;
+  const int result = enabled == 1 ? VerifyManifest(command.verbose) : 0;
+  const int verdict = enabled == 1 ? LastBootVerdict() : -1;
+  keymgr::cli::MeasureVerdict(KEYMGR_MEASURE_PCR, verdict == 0   ? Verdict::kOk
+                                                  : verdict == 1 ? Verdict::kFail
+                                                                 : Verdict::kNone);
+  return Finish(result);
+#else
   if (enabled != 1) {
     return Finish(0);
   }
   return Finish(VerifyManifest(command.verbose));
+#endif
 }

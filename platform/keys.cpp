@@ -3,11 +3,15 @@
 #include <openssl/crypto.h>
 #include <tss2/tss2_mu.h>
 
+#include <array>
 #include <cstring>
+#include <span>
 
 #include "crypto/hash.h"
+#include "keymgr_build_config.h"
 #include "platform/fragment.h"
 #include "platform/keys.h"
+#include "platform/verdict.h"
 #include "util/secure.h"
 
 namespace keymgr::tpm {
@@ -43,18 +47,84 @@ uint32_t PersistentHandle(const uint8_t* nameDigest) {
   return kOwnKeysFirst + bits % (kOwnerPersistentLast - kOwnKeysFirst + 1);
 }
 
+// A sealed key's user role is reached only through its policy.
+constexpr TPMA_OBJECT kSealedKeyAttributes = kKeyAttributes & ~TPMA_OBJECT_USERWITHAUTH;
+
+int g_sealPcr = KEYMGR_SEAL_PCR;
+
+void PutBig32(crypto::Sha256& sha, uint32_t value) {
+  const uint8_t bytes[4] = {static_cast<uint8_t>(value >> 24), static_cast<uint8_t>(value >> 16),
+                            static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)};
+  (void)sha.Update(bytes, sizeof(bytes));
+}
+
+// VerdictPolicy is the authPolicy of a key sealed to PCR |pcr|: TPM2_PolicyPCR
+// with the PCR at the good verdict's value, then TPM2_PolicyAuthValue, as the
+// TPM computes them from an empty policy. Like the marker, it depends on
+// nothing that a regeneration or an update changes, so it marks the keys of
+// this system as well.
+TPM2B_DIGEST VerdictPolicy(int pcr) {
+  std::array<uint8_t, 32> pcrDigest{};
+  const PcrValue good = GoodPcrValue();
+  crypto::Sha256 values;
+  (void)values.Update(good.data(), good.size());
+  (void)values.Final(pcrDigest);
+  std::array<uint8_t, sizeof(TPML_PCR_SELECTION)> selection{};
+  std::size_t size = 0;
+  const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);
+  (void)Tss2_MU_TPML_PCR_SELECTION_Marshal(&pcrs, selection.data(), selection.size(), &size);
+  TPM2B_DIGEST policy{};
+  policy.size = 32;
+  crypto::Sha256 first;
+  (void)first.Update(policy.buffer, 32);
+  PutBig32(first, TPM2_CC_PolicyPCR);
+  (void)first.Update(selection.data(), size);
+  (void)first.Update(pcrDigest.data(), pcrDigest.size());
+  (void)first.Final(std::span<uint8_t, 32>(policy.buffer, 32));
+  crypto::Sha256 second;
+  (void)second.Update(policy.buffer, 32);
+  PutBig32(second, TPM2_CC_PolicyAuthValue);
+  (void)second.Final(std::span<uint8_t, 32>(policy.buffer, 32));
+  return policy;
+}
+
 // IsOwnKey tells whether |area| is the public area of a key this key manager
-// created: its template and its marker.
+// created: its template, and the marker or, for a sealed key, the verdict
+// policy of one of the 24 PCRs. Keys of plain and sealed builds are both
+// known, so that changing the build strands none.
 bool IsOwnKey(const TPMT_PUBLIC& area) {
   const TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
-  return area.type == TPM2_ALG_RSA && area.nameAlg == TPM2_ALG_SHA256 &&
-         area.objectAttributes == kKeyAttributes && area.authPolicy.size == sizeof(kKeyMarker) &&
-         std::memcmp(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker)) == 0 &&
+  const bool plain = area.objectAttributes == kKeyAttributes && area.authPolicy.size == 32 &&
+                     std::memcmp(area.authPolicy.buffer, kKeyMarker, 32) == 0;
+  bool sealed = false;
+  for (int pcr = 0; pcr < 24 && !plain && !sealed &&
+                    area.objectAttributes == kSealedKeyAttributes && area.authPolicy.size == 32;
+       ++pcr) {
+    sealed = std::memcmp(area.authPolicy.buffer, VerdictPolicy(pcr).buffer, 32) == 0;
+  }
+  return area.type == TPM2_ALG_RSA && area.nameAlg == TPM2_ALG_SHA256 && (plain || sealed) &&
          rsa.symmetric.algorithm == TPM2_ALG_NULL && rsa.scheme.scheme == TPM2_ALG_OAEP &&
          rsa.scheme.details.oaep.hashAlg == TPM2_ALG_SHA256;
 }
 
 }  // namespace
+
+int SealPcr() {
+  return g_sealPcr;
+}
+
+void SetSealPcr(int pcr) {
+  g_sealPcr = pcr >= 0 && pcr < 24 ? pcr : -1;
+}
+
+TPML_PCR_SELECTION PcrSelection(int pcr) {
+  TPML_PCR_SELECTION pcrs{};
+  pcrs.count = 1;
+  pcrs.pcrSelections[0].hash = TPM2_ALG_SHA256;
+  pcrs.pcrSelections[0].sizeofSelect = 3;
+  pcrs.pcrSelections[0].pcrSelect[pcr / 8] = static_cast<uint8_t>(1u << (pcr % 8));
+  return pcrs;
+}
 
 uint32_t HandleOfName(const char* nameHex) {
   uint8_t nameDigest[kDigestSize];
@@ -83,9 +153,13 @@ TPM2B_TEMPLATE KeyTemplate(uint32_t bits) {
   TPMT_PUBLIC area{};
   area.type = TPM2_ALG_RSA;
   area.nameAlg = TPM2_ALG_SHA256;
-  area.objectAttributes = kKeyAttributes;
-  area.authPolicy.size = sizeof(kKeyMarker);
-  std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
+  area.objectAttributes = g_sealPcr >= 0 ? kSealedKeyAttributes : kKeyAttributes;
+  if (g_sealPcr >= 0) {
+    area.authPolicy = VerdictPolicy(g_sealPcr);
+  } else {
+    area.authPolicy.size = sizeof(kKeyMarker);
+    std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
+  }
   TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
   rsa.symmetric.algorithm = TPM2_ALG_NULL;
   rsa.scheme.scheme = TPM2_ALG_OAEP;

@@ -37,6 +37,15 @@ Status DeleteKey(Connection& tpm, const std::uint8_t* nameDigest);
 // |keepNameDigest| (may be null).
 Status EvictStaleKeys(Connection& tpm, const std::uint8_t* keepNameDigest);
 
+// The keys a sealed build creates (KEYMGR_SEAL_TO_VERDICT) require PCR
+// SealPcr() at the good boot verdict's value as well as their password; -1
+// when keys are plain. SetSealPcr changes it for the keys created and opened
+// from then on.
+int SealPcr();
+void SetSealPcr(int pcr);
+// PcrSelection selects PCR |pcr| of the SHA-256 bank.
+TPML_PCR_SELECTION PcrSelection(int pcr);
+
 // Sealing (seal.cpp).
 
 // Seal seals |length| bytes under the public part of the key of |nameHex|

@@ -123,6 +123,10 @@ void pcp_set_transport_for_testing(const char* tcti, int deadlineMs) {
   SetTransport(tcti, deadlineMs);
 }
 
+void pcp_set_seal_pcr_for_testing(int pcr) {
+  SetSealPcr(pcr);
+}
+
 int pcp_persist_srk(void) {
   return OnTpm([](Connection& tpm) { return PersistSrk(tpm); });
 }

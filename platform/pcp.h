@@ -72,6 +72,16 @@ PCP_NODISCARD int pcp_decryptDataFragment(const char* nameHex, const char* passH
                                           const uint8_t* fragment, uint32_t length, uint8_t* out,
                                           uint32_t* outSize);
 
+// pcp_extend_pcr extends PCR |pcr| (0 to 23) of the SHA-256 bank with the 32
+// bytes at |digest|, on a connection of its own.
+PCP_NODISCARD int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest);
+
+// pcp_set_seal_pcr_for_testing makes the keys created from now on require
+// PCR |pcr| of the SHA-256 bank at the good boot verdict's value, and opens
+// their fragments in a policy session that meets it, as a build with
+// KEYMGR_SEAL_TO_VERDICT does; -1 makes them plain keys again. For tests.
+void pcp_set_seal_pcr_for_testing(int pcr);
+
 // pcp_set_transport_for_testing makes the calls that follow open their
 // connections on |tcti| (a tpm2-tss TCTI configuration; "swtpm:" takes this
 // key manager's own transport) with a deadline of |deadlineMs| on every

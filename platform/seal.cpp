@@ -21,6 +21,31 @@ TPMT_RSA_DECRYPT OaepSha256() {
   return scheme;
 }
 
+// MeetVerdictPolicy runs the policy of a key sealed to PCR |pcr| in
+// |session|: the PCR as it is now, then the key's password, which the
+// decryption's HMAC then carries.
+Status MeetVerdictPolicy(Connection& tpm, ESYS_TR session, int pcr) {
+  const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);
+  const TPM2B_DIGEST current{};  // the TPM takes the PCR's value as it stands
+  if (Status status = Run(
+          tpm, "Esys_PolicyPCR",
+          [&] {
+            return Esys_PolicyPCR_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                        ESYS_TR_NONE, &current, &pcrs);
+          },
+          [&] { return Esys_PolicyPCR_Finish(tpm.ctx()); });
+      !status.ok()) {
+    return status;
+  }
+  return Run(
+      tpm, "Esys_PolicyAuthValue",
+      [&] {
+        return Esys_PolicyAuthValue_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                          ESYS_TR_NONE);
+      },
+      [&] { return Esys_PolicyAuthValue_Finish(tpm.ctx()); });
+}
+
 }  // namespace
 
 // Sealing needs only the key's public part: it is done on the host, and the
@@ -99,11 +124,22 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
       return status;
     }
   }
+  // A sealed key opens only in a policy session that meets its policy. That
+  // session is not bound: TPM2_PolicyAuthValue puts the password in its keys
+  // as binding would (tpm2-tss leaves it out of a bound policy session's
+  // HMAC, where the TPM takes it in), so the response is encrypted all the
+  // same.
+  const int pcr = SealPcr();
   ESYS_TR bound = ESYS_TR_NONE;
-  if (Status status = StartHmacSession(tpm, ESYS_TR_NONE, tr, &bound); !status.ok()) {
+  if (Status status = StartSession(tpm, ESYS_TR_NONE, pcr >= 0 ? ESYS_TR_NONE : tr, &bound,
+                                   pcr >= 0 ? TPM2_SE_POLICY : TPM2_SE_HMAC);
+      !status.ok()) {
     return status;
   }
   TransientObject session(tpm.Object(bound));
+  if (Status status = pcr >= 0 ? MeetVerdictPolicy(tpm, bound, pcr) : Status(); !status.ok()) {
+    return status;
+  }
   if (Status status =
           Check("Esys_TRSess_SetAttributes",
                 Esys_TRSess_SetAttributes(tpm.ctx(), bound, TPMA_SESSION_ENCRYPT, 0xff));

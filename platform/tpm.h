@@ -174,12 +174,13 @@ Status EvictPersistent(Connection& tpm, TPM2_HANDLE handle);
 // template, else a primary created from that template (the same key).
 Status UseParent(Connection& tpm);
 
-// StartHmacSession starts an HMAC session with AES-128-CFB parameter
-// encryption, salted by |tpmKey| and bound to |bind| (either may be
-// ESYS_TR_NONE), and leaves it in |session|. The caller owns the session.
-// Its nonce comes from the kernel without waiting, so that a boot never
-// waits for the kernel's pool.
-Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session);
+// StartSession starts a session of |type| (an HMAC session unless asked)
+// with AES-128-CFB parameter encryption, salted by |tpmKey| and bound to
+// |bind| (either may be ESYS_TR_NONE), and leaves it in |session|. The caller
+// owns the session. Its nonce comes from the kernel without waiting, so that
+// a boot never waits for the kernel's pool.
+Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session,
+                    TPM2_SE type = TPM2_SE_HMAC);
 
 // UseSaltedSession makes the connection's HMAC session available, salted by
 // the parent, and sets its parameter encryption to |attributes|

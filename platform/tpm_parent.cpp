@@ -106,7 +106,7 @@ Status UseParent(Connection& tpm) {
   return tpm.broken ? Refused("TPM connection lost") : CreatePrimary(tpm);
 }
 
-Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session) {
+Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session, TPM2_SE type) {
   TPMT_SYM_DEF symmetric{};
   symmetric.algorithm = TPM2_ALG_AES;
   symmetric.keyBits.aes = 128;
@@ -130,8 +130,7 @@ Status StartHmacSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* 
       tpm, "Esys_StartAuthSession",
       [&] {
         return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE, &nonce, TPM2_SE_HMAC, &symmetric,
-                                           TPM2_ALG_SHA256);
+                                           ESYS_TR_NONE, &nonce, type, &symmetric, TPM2_ALG_SHA256);
       },
       [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });
 }
@@ -142,7 +141,7 @@ Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes) {
       return status;
     }
     ESYS_TR session = ESYS_TR_NONE;
-    if (Status status = StartHmacSession(tpm, tpm.Parent(), ESYS_TR_NONE, &session); !status.ok()) {
+    if (Status status = StartSession(tpm, tpm.Parent(), ESYS_TR_NONE, &session); !status.ok()) {
       return status;
     }
     tpm.session.reset(tpm.Object(session));

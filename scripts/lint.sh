@@ -8,9 +8,11 @@ cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 
 build="build-lint"
-# A signed build (the test key), so that the signature check is analysed too.
+# A signed, measured and sealed build (the test key), so that the code of
+# every opt-in build is analysed too.
 cmake -S . -B "$build" -G Ninja -DBUILD_TESTING=OFF -DCMAKE_EXPORT_COMPILE_COMMANDS=ON \
-  -DKEYMGR_DIGEST_PUBKEY="$PWD/tests/cli/data/digest_key.pub.pem" >/dev/null
+  -DKEYMGR_DIGEST_PUBKEY="$PWD/tests/cli/data/digest_key.pub.pem" -DKEYMGR_MEASURE_PCR=14 \
+  -DKEYMGR_SEAL_TO_VERDICT=ON >/dev/null
 
 echo "== clang-tidy"
 log=$build/clang-tidy.log

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -223,6 +224,108 @@ TEST(KeymgrTest, MkdigestMakesWhatHashMakesInsideTheImageRoot) {
                           "d67af18613dd80afafae7b105ced93610409cfbd2adaf949f0f837007f407405df5685"
                           "54815b2a416e02e05e361c0c")));
   }
+}
+
+// The PCR value of a PCR reset to zeros and extended with |verdict|'s event.
+std::string PcrAfter(const std::string& verdict) {
+  std::string pcr =
+      t::Hex(t::Sha256(std::string(32, '\0') + t::Sha256("keymgr boot verdict: " + verdict)));
+  std::erase(pcr, ' ');
+  return verdict.empty() ? std::string(64, '0') : pcr;
+}
+
+// keymgr-measured extends PCR 14 with one event a boot run whose digest is
+// its verdict's alone: after a power cycle the PCR holds the good value only
+// after a good boot, and its event log replays to the PCR. A run without a
+// TPM keeps its BN line and status, and leaves the log empty. A verifier
+// follows the README's recipe: an attestation key quotes the PCR with its
+// nonce, tpm2_checkquote checks the quote, keymgr-eventlog replays the log to
+// the quoted value; an edited log and a stale nonce are refused.
+TEST(KeymgrTest, MeasuredBootPutsItsVerdictInAPcrThatAQuoteAttests) {
+  const std::string M = KEYMGR_TEST_MEASURED_BIN, K = KEYMGR_TEST_KEYMGR_BIN, tcti = KEYMGR_TCTI;
+  const std::string events = keymgr::kEventLogPath,
+                    socket = tcti.substr(std::strlen("swtpm:path="));
+  // PCR 14 as tpm2-tools print it (upper case), and as a quote gives it.
+  const auto pcr = [&] {
+    const std::string out = t::Run({"tpm2_pcrread", "sha256:14", "-T", tcti}).out;
+    return out.substr(out.find("0x") + 2, 64);
+  };
+  const auto in = [](const char* name) { return t::InRoot(std::string("/run/") + name); };
+  // quote quotes PCR 14 with |nonce| and checks the quote with |check|.
+  const auto quote = [&](const std::string& nonce, const std::string& check) {
+    const t::RunResult q = t::Run({"tpm2_quote", "-c", "0x81010002", "-l", "sha256:14", "-q", nonce,
+                                   "-m", in("quote.msg"), "-s", in("quote.sig"), "-o",
+                                   in("quote.pcrs"), "-g", "sha256", "-T", tcti});
+    const bool checked =
+        t::Run({"tpm2_checkquote", "-u", in("ak.pub"), "-m", in("quote.msg"), "-s", in("quote.sig"),
+                "-f", in("quote.pcrs"), "-g", "sha256", "-q", check})
+            .status == 0;
+    const std::size_t at = q.out.find("14: 0x");
+    return checked && at != std::string::npos ? q.out.substr(at + 6, 64) : "refused";
+  };
+  // The endorsement and attestation keys, persistent: the simulator has no
+  // resource manager to keep its few slots clear.
+  const auto keep = t::PersistentHandles();
+  for (const std::vector<std::string>& step :
+       {std::vector<std::string>{"tpm2_createek", "-c", "0x81010001", "-G", "rsa", "-u",
+                                 in("ek.pub")},
+        {"tpm2_createak", "-C", "0x81010001", "-c", in("ak.ctx"), "-G", "rsa", "-g", "sha256", "-s",
+         "rsassa", "-u", in("ak.pub"), "-f", "pem"},
+        {"tpm2_evictcontrol", "-c", in("ak.ctx"), "0x81010002"},
+        {"tpm2_flushcontext", "-t"}}) {
+    auto args = step;
+    args.insert(args.end(), {"-T", tcti});
+    ASSERT_EQ(t::Run(args).status, 0) << step[0];
+  }
+  const struct {
+    const char* name;
+    std::function<void()> change;
+    int status;
+    std::string line, verdict;  // a line of the output; "" for no event
+  } rows[] = {
+      // clang-format off
+      {"a good boot", [] {}, 0, "BN=OK\n", "BN=OK"},
+      {"a file altered", Put(b, "x"), 0, "BN=FAIL\n", "BN=FAIL"},
+      {"no digest file", Put(kDigests), 1, "BN=FAIL\n", "BN=FAIL"},
+      {"the gate closed", [] { t::MakeEeprom(0x00, 0); }, 0, kOff, "none"},
+      {"no EEPROM", Put(KEYMGR_EEPROM_PATH), 0, "Read Error [-2]", "none"},
+      {"no TPM", [&] { fs::rename(socket, socket + ".away"); }, 0, "BN=OK\n", ""},
+      // clang-format on
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    t::ResetDevice(0x42, 0);
+    t::WriteFile(a, "");
+    t::WriteFile(b, "b");
+    t::WriteFile(kManifest, a + " " + b);
+    t::Run({K, "hash"});
+    t::PowerCycleTpm();
+    row.change();
+    const t::RunResult run = t::Run({M});
+    if (row.verdict.empty()) {
+      fs::rename(socket + ".away", socket);
+    }
+    EXPECT_EQ(run.status, row.status);
+    EXPECT_NE(run.out.find(row.line), std::string::npos) << run.out;
+    EXPECT_EQ(pcr(), PcrAfter(row.verdict));
+    EXPECT_EQ(t::Run({KEYMGR_TEST_EVENTLOG_BIN, events, "--expect", pcr()}).status,
+              row.verdict.empty() ? 1 : 0);
+    EXPECT_EQ(t::ReadFile(events)->find("\"verdict\":\"" + row.verdict + "\"") != std::string::npos,
+              !row.verdict.empty());
+    if (row.verdict.starts_with("BN=")) {  // a verifier's view of the boot
+      EXPECT_EQ(quote("feed01", "feed01"), PcrAfter(row.verdict));
+      EXPECT_EQ(quote("feed02", "feed01"), "refused");
+      EXPECT_EQ(
+          t::Run({KEYMGR_TEST_EVENTLOG_BIN, events, "--expect", quote("feed03", "feed03")}).status,
+          0);
+      std::string edited = *t::ReadFile(events);
+      edited.replace(edited.find(row.verdict), row.verdict.size(),
+                     row.verdict == "BN=OK" ? "BN=FAIL" : "BN=OK");
+      t::WriteFile(events, edited);
+      EXPECT_NE(t::Run({KEYMGR_TEST_EVENTLOG_BIN, events, "--expect", pcr()}).status, 0);
+    }
+  }
+  t::EvictAllBut(keep);
 }
 
 // keymgr hash killed anywhere leaves the old digest file or the new one,

@@ -262,5 +262,55 @@ TEST(Tpm, EveryCommandFailedEndsInTimeAndLeavesOneKey) {
   EvictAllBut(keep);
 }
 
+// With keys sealed to the verdict in PCR 14, across power cycles (PCRs
+// reset, keys kept): a good boot opens the key, a failed boot or none does
+// not, and a regeneration and a new digest file need no sealing again. The
+// sealed boot spends at most 6 TPM commands, one of them asymmetric.
+TEST(Tpm, AKeySealedToTheVerdictOpensOnlyAfterAGoodBoot) {
+  const auto keep = PersistentHandles();
+  ResetDevice(0x42, 4);
+  const std::string listed = InRoot("/d/a"), K = KEYMGR_TEST_KEYMGR_BIN;
+  WriteFile(listed, "a");
+  WriteFile(kManifestPath, listed);
+  ASSERT_EQ(test::Run({K, "hash"}).status, 0);
+  OnProxy bus;
+  pcp_set_seal_pcr_for_testing(14);
+  ASSERT_NE(KeyManage(KMM_OPTION_REGENERATE, 0), nullptr);
+  // boot powers the TPM off and on, runs keymgr-measured unless told not to,
+  // and gives the context when the key material then proves.
+  const auto boot = [&](bool measured) {
+    PowerCycleTpm();
+    if (measured) {
+      test::Run({KEYMGR_TEST_MEASURED_BIN});
+    }
+    bus.proxy.Arm(TpmProxy::Fault::kNone, 0);
+    const KeyContext* context = nullptr;
+    const std::string out = Output([&] { context = KeyManage(KMM_OPTION_NORMAL_BOOT, 1); });
+    EXPECT_EQ(out.find("DT=OK") != std::string::npos, context != nullptr) << out;
+    return context;
+  };
+  const KeyContext* context = boot(true);
+  ASSERT_NE(context, nullptr);
+  const Cost cost = CostOf(bus.proxy.Sent());
+  EXPECT_LE(cost.commands, 6);
+  EXPECT_EQ(cost.asymmetric, 1);
+  std::string ook;  // and the response crossed encrypted
+  for (std::uint32_t i = 0; i < 32; ++i) {
+    ook += static_cast<char>(ProtectedKey_ByteAt(context->oneOffKeyRef, i));
+  }
+  EXPECT_EQ(bus.proxy.Traffic().find(ook), std::string::npos);
+  WriteFile(listed, "altered");
+  EXPECT_EQ(boot(true), nullptr);
+  WriteFile(listed, "a");
+  EXPECT_EQ(boot(false), nullptr);
+  ASSERT_NE(KeyManage(KMM_OPTION_REGENERATE, 0), nullptr);
+  WriteFile(InRoot("/d/b"), "b");
+  WriteFile(kManifestPath, listed + " " + InRoot("/d/b"));
+  ASSERT_EQ(test::Run({K, "hash"}).status, 0);
+  EXPECT_NE(boot(true), nullptr);
+  pcp_set_seal_pcr_for_testing(-1);
+  EvictAllBut(keep);
+}
+
 }  // namespace
 }  // namespace keymgr::test

@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -203,6 +204,12 @@ std::string Output(const std::function<void()>& call) {
   testing::internal::CaptureStdout();
   call();
   return testing::internal::GetCapturedStdout();
+}
+
+void PowerCycleTpm() {
+  const std::string socket = std::string(KEYMGR_TCTI).substr(std::strlen("swtpm:path="));
+  EXPECT_EQ(Run({"swtpm_ioctl", "--unix", socket + ".ctrl", "-i"}).status, 0);
+  EXPECT_EQ(Run({"tpm2_startup", "-c", "-T", KEYMGR_TCTI}).status, 0);
 }
 
 std::set<std::string> PersistentHandles(const std::string& tcti) {

@@ -59,6 +59,10 @@ std::string SyncTrace(const std::vector<std::string>& argv);
 // Output runs |call| and returns what it printed on standard output.
 std::string Output(const std::function<void()>& call);
 
+// PowerCycleTpm turns the suite's swtpm off and on again, as a reboot does:
+// its PCRs are reset, its persistent objects kept, and it is started.
+void PowerCycleTpm();
+
 // PersistentHandles lists the persistent handles of the TPM at |tcti| (the
 // suite's swtpm by default), as tpm2_getcap sees them. EvictAllBut evicts
 // every one that is not in |keep|.

@@ -1,0 +1,103 @@
+#include "cli/measure.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <array>
+#include <cstdint>
+#include <cstdio>
+
+#include "crypto/file_digest.h"
+#include "integrity/signature.h"
+#include "platform/pcp.h"
+#include "util/io.h"
+#include "util/owned.h"
+#include "util/paths.h"
+#include "util/status.h"
+
+namespace keymgr::cli {
+
+namespace {
+
+// HexOf writes the 64 hex digits of |digest| and a NUL at |text|.
+void HexOf(const std::array<std::uint8_t, 32>& digest, char (&text)[65]) {
+  for (std::size_t i = 0; i < digest.size(); ++i) {
+    (void)std::snprintf(text + 2 * i, 3, "%02x", digest[i]);
+  }
+}
+
+// FileField appends ,"NAME":"SHA-256 of PATH" to |content| when the file
+// can be hashed.
+void FileField(const char* name, const char* path, char* content, std::size_t size,
+               std::size_t* used) {
+  std::array<std::uint8_t, kFileDigestSize> digest{};
+  char hex[65];
+  if (*used < size && ComputeFileDigest(path, digest).ok()) {
+    HexOf(digest, hex);
+    *used += static_cast<std::size_t>(
+        std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"", name, hex));
+  }
+}
+
+// ReleaseField appends ,"release":N, the counter of keymgr.sig, when a
+// signed build reads one.
+void ReleaseField(char* content, std::size_t size, std::size_t* used) {
+#if KEYMGR_SIGNED_BUILD
+  std::array<std::uint8_t, integrity::kSignatureFileSize> bytes{};
+  integrity::SignatureFile signature;
+  const File file = OpenFile(kSignaturePath, "r");
+  if (*used < size && file &&
+      std::fread(bytes.data(), 1, bytes.size(), file.get()) == bytes.size() &&
+      integrity::DecodeSignatureFile(bytes, &signature).ok()) {
+    *used +=
+        static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"release\":%llu",
+                                               static_cast<unsigned long long>(signature.counter)));
+  }
+#else
+  (void)content;
+  (void)size;
+  (void)used;
+#endif
+}
+
+}  // namespace
+
+void MeasureVerdict(unsigned pcr, tpm::Verdict verdict) {
+  const tpm::PcrValue digest = tpm::VerdictDigest(verdict);
+  const bool extended = pcp_extend_pcr(pcr, digest.data()) == 0;
+  if (!extended) {
+    (void)Refused("extend of the boot verdict");
+  }
+  // The record of the event: the TCG canonical event log's JSON form, one
+  // record a line. What it names beside the verdict is for a verifier; only
+  // the verdict is measured.
+  char content[512];
+  std::size_t used = static_cast<std::size_t>(
+      std::snprintf(content, sizeof(content), "{\"verdict\":\"%s\"", tpm::VerdictName(verdict)));
+  if (verdict != tpm::Verdict::kNone) {
+    FileField("manifest_sha256", kManifestPath, content, sizeof(content), &used);
+    FileField("digests_sha256", kDigestFilePath, content, sizeof(content), &used);
+    ReleaseField(content, sizeof(content), &used);
+  }
+  char hex[65];
+  HexOf(digest, hex);
+  char line[768];
+  const int length =
+      std::snprintf(line, sizeof(line),
+                    "{\"recnum\":0,\"pcr\":%u,\"digests\":[{\"hashAlg\":\"sha256\","
+                    "\"digest\":\"%s\"}],\"content_type\":\"keymgr\",\"content\":%s}}\n",
+                    pcr, hex, content);
+  // The log lies beside the status log and is kept with the same care. A
+  // failed extend leaves it empty, so that it never claims an event the PCR
+  // does not hold.
+  const Descriptor log =
+      OpenRegular(kEventLogPath, O_WRONLY | O_CREAT | O_TRUNC, nullptr, Look::kOwnName);
+  const auto write = [&](std::size_t done, std::size_t left) {
+    return ::write(log.get(), line + done, left);
+  };
+  if (!log || (extended && length > 0 && !MoveAll(write, static_cast<std::size_t>(length)))) {
+    (void)ErrnoFailure("event log");
+  }
+}
+
+}  // namespace keymgr::cli

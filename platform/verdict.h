@@ -1,0 +1,27 @@
+// The boot verdict as the TPM measures it: one event per boot run, whose
+// digest depends on the verdict alone, so that a good boot gives the same
+// PCR value on every device and after every update, and a key can require
+// it.
+#pragma once
+
+#include <array>
+#include <cstdint>
+
+namespace keymgr::tpm {
+
+enum class Verdict { kOk, kFail, kNone };
+
+using PcrValue = std::array<std::uint8_t, 32>;
+
+// VerdictDigest is the SHA-256 of "keymgr boot verdict: " and BN=OK,
+// BN=FAIL, or "none" for a run that verified nothing.
+PcrValue VerdictDigest(Verdict verdict);
+
+// GoodPcrValue is the value of a PCR reset to zeros (PCRs 0-15 at power on)
+// extended once with the good verdict's digest.
+PcrValue GoodPcrValue();
+
+// VerdictName is the verdict as the event log names it.
+const char* VerdictName(Verdict verdict);
+
+}  // namespace keymgr::tpm
