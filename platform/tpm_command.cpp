@@ -110,8 +110,12 @@ void FlushLeftovers(Connection& tpm) {
     }
     for (std::uint32_t i = 0; i < data.data.handles.count; ++i) {
       const TPM2_HANDLE handle = data.data.handles.handle[i];
-      if ((handle >> TPM2_HR_SHIFT) == (first >> TPM2_HR_SHIFT) &&
-          std::find(own.begin(), own.end(), handle) == own.end()) {
+      // Both session lists give HMAC and policy session handles alike.
+      const std::uint32_t type = handle >> TPM2_HR_SHIFT;
+      const bool listed = first == TPM2_TRANSIENT_FIRST
+                              ? type == TPM2_HT_TRANSIENT
+                              : type == TPM2_HT_HMAC_SESSION || type == TPM2_HT_POLICY_SESSION;
+      if (listed && std::find(own.begin(), own.end(), handle) == own.end()) {
         (void)RawCommand(tpm, "TPM2_FlushContext",
                          [&] { return Tss2_Sys_FlushContext_Prepare(tpm.sys, handle); });
       }
