@@ -1,14 +1,17 @@
 // The manifest and digest-file reader. The input picks up to four data files
 // and a manifest, either raw bytes or entries the harness lays out itself
-// (the data files, missing and directory names, names too long for the path
-// buffer, names with a NUL byte, with any white space between). The harness
-// then builds the digest file, maybe damages it, and verifies. Entries are
-// names in a scratch folder, so nothing outside it is read. For laid-out
+// (the data files, missing, directory and FIFO names, names too long for the
+// path buffer, names with a NUL byte, with any white space between). The
+// harness then builds the digest file, maybe damages it, and verifies. Entries
+// are names in a scratch folder, so nothing outside it is read. For laid-out
 // manifests the records and the BN line must be those of a model: the
 // digests of the leading entries that can be hashed, and BN=OK only for an
 // undamaged digest file and a manifest with no failing entry. For any
-// manifest, the verbose and quiet runs agree.
+// manifest, the verbose and quiet runs log the same, and every run with one
+// hashing thread prints, logs and writes what it does with four.
 #include <fuzzer/FuzzedDataProvider.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <array>
 #include <cstdint>
@@ -29,14 +32,28 @@ using test::Require;
 constexpr std::size_t kDataFiles = 4;
 constexpr char kSpaces[] = " \t\n\v\f\r";
 
-// Verify runs the boot check and returns its result and whether it logged
-// BN=OK.
-std::pair<int, bool> Verify(int verbose) {
+// The folder the manifest's names are read in, and the file standard output
+// goes to.
+fs::path Scratch() {
+  return fs::path(kManifestPath).parent_path().parent_path() / "fuzz-files";
+}
+const std::string kOutput = Scratch().parent_path() / "fuzz-output";
+
+// Run runs |call| with |threads| hashing threads and returns its result,
+// what it printed, the boot status log and the digest file.
+using Outcome = std::array<std::string, 4>;
+Outcome Run(int threads, int (*call)(int), int verbose = 0) {
+  setenv("KEYMGR_HASH_THREADS", std::to_string(threads).c_str(), 1);
   std::remove(kBootLogPath);
-  const int result = VerifyManifest(verbose);
-  const auto log = test::ReadFile(kBootLogPath);
-  Require(log == "BN=OK\n" || log == "BN=FAIL\n");
-  return {result, log == "BN=OK\n"};
+  Require(std::fflush(stdout) == 0 && ftruncate(fileno(stdout), 0) == 0);
+  std::rewind(stdout);
+  const int result = call(verbose);
+  std::fflush(stdout);
+  return {std::to_string(result), test::ReadFile(kOutput).value_or(""),
+          test::ReadFile(kBootLogPath).value_or(""), test::ReadFile(kDigestFilePath).value_or("")};
+}
+int Hash(int) {
+  return HashManifest();
 }
 
 // LayOut writes a manifest of entries chosen by |in|, and sets |records| to
@@ -48,7 +65,7 @@ std::string LayOut(FuzzedDataProvider& in, const std::array<std::string, kDataFi
   for (std::size_t i = 0; i < count; ++i) {
     text.append(in.ConsumeIntegralInRange<std::size_t>(i == 0 ? 0 : 1, 3),
                 kSpaces[in.ConsumeIntegralInRange<std::size_t>(0, sizeof(kSpaces) - 2)]);
-    const int kind = in.ConsumeIntegralInRange(0, 5);
+    const int kind = in.ConsumeIntegralInRange(0, 6);
     const std::size_t file = in.ConsumeIntegralInRange<std::size_t>(0, kDataFiles - 1);
     if (kind <= 1 && allHashed) {
       records += test::Sha256(data[file]);
@@ -59,14 +76,10 @@ std::string LayOut(FuzzedDataProvider& in, const std::array<std::string, kDataFi
             : kind == 2 ? "missing"
             : kind == 3 ? "dir"
             : kind == 4 ? std::string(in.ConsumeIntegralInRange<std::size_t>(99, 120), 'n')
+            : kind == 5 ? "fifo"
                         : std::string("f0\0x", in.ConsumeIntegralInRange<std::size_t>(3, 4));
   }
   return text.append(in.ConsumeIntegralInRange<std::size_t>(0, 2), '\n');
-}
-
-// The folder the manifest's names are read in.
-fs::path Scratch() {
-  return fs::path(kManifestPath).parent_path().parent_path() / "fuzz-files";
 }
 
 }  // namespace
@@ -75,8 +88,9 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fs::create_directories(fs::path(kManifestPath).parent_path());
   fs::create_directories(fs::path(kBootLogPath).parent_path());
   fs::create_directories(Scratch() / "dir");
-  // The verbose runs print every digest; only the checks below matter.
-  return std::freopen("/dev/null", "w", stdout) != nullptr ? 0 : 1;
+  mkfifo((Scratch() / "fifo").c_str(), 0600);
+  // What the runs print is compared through this file.
+  return std::freopen(kOutput.c_str(), "w+", stdout) != nullptr ? 0 : 1;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t size) {
@@ -103,7 +117,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t siz
   if (manifest.find('/') == std::string::npos) {
     test::WriteFile(kManifestPath, manifest);
     std::remove(kDigestFilePath);
-    Require(HashManifest() == 0);
+    const Outcome hashed = Run(1, Hash);
+    Require(hashed[0] == "0" && Run(4, Hash) == hashed);
     std::string records = test::ReadFile(kDigestFilePath).value_or("");
     Require(!laidOut || records == model);
     // Damage: one byte changed, or the file cut short.
@@ -117,9 +132,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t siz
       }
       test::WriteFile(kDigestFilePath, records);
     }
-    const auto quiet = Verify(0);
-    Require(Verify(1) == quiet && quiet.first == 0);
-    Require(!laidOut || quiet.second == (allHashed && (damage == 0 || model.empty())));
+    const Outcome quiet = Run(1, VerifyManifest), verbose = Run(1, VerifyManifest, 1);
+    Require(Run(4, VerifyManifest) == quiet && Run(4, VerifyManifest, 1) == verbose);
+    Require(quiet[0] == "0" && (quiet[2] == "BN=OK\n" || quiet[2] == "BN=FAIL\n") &&
+            verbose[2] == quiet[2] && quiet[3] == records);
+    Require(!laidOut || (quiet[2] == "BN=OK\n") == (allHashed && (damage == 0 || model.empty())));
     VerifyManifestFile(in.ConsumeRandomLengthString(8).c_str());
   }
   fs::current_path(home);

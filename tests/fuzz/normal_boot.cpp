@@ -15,30 +15,12 @@
 #include <filesystem>
 #include <string>
 
-#include "crypto/hash.h"
 #include "support/fake_platform.h"
 #include "support/files.h"
-#include "util/bytes.h"
 #include "util/paths.h"
-
-namespace {
 
 namespace fs = std::filesystem;
 using namespace keymgr;
-
-// Md5OfHex is the key manager's name for 20 bytes of a key file: the MD5 of
-// their hex text.
-std::string Md5OfHex(const char* path) {
-  std::string bytes = test::ReadFile(path).value_or("");
-  bytes.resize(20);
-  char hex[41] = {};
-  std::uint8_t digest[16] = {};
-  (void)BytesToHex(reinterpret_cast<const std::uint8_t*>(bytes.data()), 20, hex, sizeof(hex));
-  (void)Md5OfString(hex, digest);
-  return {reinterpret_cast<const char*>(digest), sizeof(digest)};
-}
-
-}  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fs::create_directories(fs::path(kKeyIdPath).parent_path());
@@ -86,7 +68,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0u, 3u);
         break;
       default:
-        keyManager.keys[Md5OfHex(kKeyIdPath)] = Md5OfHex(kKeyPwdPath);
+        keyManager.keys[test::KeyAuth(test::ReadFile(kKeyIdPath).value_or(""))] =
+            test::KeyAuth(test::ReadFile(kKeyPwdPath).value_or(""));
         break;
     }
   }
