@@ -1,7 +1,5 @@
 #include "crypto/file_digest.h"
 
-#include <openssl/evp.h>
-
 #include <gtest/gtest.h>
 
 #include <array>
@@ -27,12 +25,7 @@ TEST(FileDigestTest, HashesTheStatSizeAcrossReads) {
   for (std::size_t i = 0; i < bytes.size(); ++i) {
     bytes[i] = static_cast<char>(i * 7 + i / 251);
   }
-  const auto sha = [](const std::string& data) {
-    std::string out(32, '\0');
-    EVP_Digest(data.data(), data.size(), reinterpret_cast<unsigned char*>(out.data()), nullptr,
-               EVP_sha256(), nullptr);
-    return out;
-  };
+  const auto sha = t::Sha256;
   // Opens a file of |size| bytes, lets |change| alter it, then hashes it.
   std::atomic<bool> stop{false};
   const auto hash = [&](std::size_t size, const std::function<void()>& change) {

@@ -8,12 +8,12 @@
 #include <filesystem>
 #include <functional>
 #include <regex>
+#include <set>
 
 #include "kmm/internal.h"
 #include "platform/eeprom_map.h"
 #include "support/fake_platform.h"
 #include "support/sandbox.h"
-#include "support/seed_guess.h"
 #include "util/paths.h"
 
 namespace keymgr::test {
@@ -133,10 +133,15 @@ std::string State() {
   return s + std::to_string(KeyManager().keys.size());
 }
 
+// A regeneration replaces the temporary names that a killed one left.
 TEST(KmmFlow, RegenerationIsProvedAtBoot) {
   Reset();
+  for (const char* name : {"/.keymgr.cs.new", "/.keymgr.hddpwd.new", "/.keymgr.ook.new"}) {
+    WriteFile(fs::path(kKeyIdPath).parent_path().string() + name, "left by a killed run");
+  }
   ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
   EXPECT_EQ(State(), "set set 32 20 20 284 1");
+  EXPECT_EQ(KeyManager().keys[KeyAuth(Text(kKeyIdPath))], KeyAuth(Text(kKeyPwdPath)));
   EXPECT_EQ(Text(kScDigestPath), Region(kScDigestOffset, kScDigestLength));
   EXPECT_EQ(Eeprom().lastSection, (std::array{kSectionStart, kSectionLength}));
   const std::string ook = Text(kStoredOokPath).substr(0, 32);  // the fake seals in the clear
@@ -171,6 +176,7 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
   const auto part = [](std::uint32_t begin, std::uint32_t end, int count) {
     return [=] { Eeprom().fault = {begin, end, count}; };
   };
+  const auto flip = [](std::uint32_t at) { return [=] { g_image[at] ^= 1; }; };
   const auto pcp = [](PcpOp op, unsigned calls = 1) {
     return [=] { KeyManager().fail[op] = calls; };
   };
@@ -208,6 +214,9 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
       {"store key never read", 1, part(kStoreKeyOffset, kStoreKeyOffset + 1, 3), retries(kRead) + kFail, "DT=FAIL\n"},
       {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); }, retries(kValues) + "Normal Boot", "-"},
       {"one-off key not unsealed", 1, pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
+      {"digest in EEPROM altered", 1, flip(kScDigestOffset + 5), "SC Digest Test Fail [EEPROM]!!\n" + kFail, "DT=FAIL\n"},
+      {"digest copy altered", 1, [] { WriteFile(kScDigestPath, std::string(32, 'x')); }, "Success [EEPROM]!!\nSC Digest Test Fail [HDD]!!\n" + kFail, "DT=FAIL\n"},
+      {"store key altered", 1, flip(kStoreKeyOffset + 20), "ST Key is decrypted!!\nSC Digest is created!!\nSC Digest Test Fail", "DT=FAIL\n"},
       {"no container for unsealing", 1, crypto(kCreate, 1, 0), "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
       {"unsealing gives 47 bytes", 1, crypto(kAesProcess, 1, 0, 47), "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
       // clang-format on
@@ -230,38 +239,67 @@ TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
   }
 }
 
-// A host that never seeds gets two different, unguessable keys within one
-// second, because the module seeds for it. The search does find keys from
-// random() seeded the weak ways after the host's seeding, so it proves
-// something when it fails.
+// SeedGuess tells how random() was seeded when it gave the eight words of
+// the seed key in |context| (after its date and time), if it was seeded a
+// weak way: not at all, with a clock within half a day, or with a low process
+// id. Returns "" otherwise.
+std::string SeedGuess(const KeyContext* context) {
+  std::array<std::int32_t, 8> words{};
+  for (std::uint32_t i = 0; i < 32; ++i) {
+    reinterpret_cast<std::uint8_t*>(words.data())[i] =
+        ProtectedKey_ByteAt(&context->seedKeyPK, 12 + i);
+  }
+  const auto seededWith = [&](unsigned seed) {
+    std::array<char, 128> state{};  // the default size, as a process starts
+    random_data data{};
+    initstate_r(seed, state.data(), state.size(), &data);
+    return std::all_of(words.begin(), words.end(), [&](std::int32_t word) {
+      std::int32_t next = 0;
+      return random_r(&data, &next) == 0 && next == word;
+    });
+  };
+  const auto now = static_cast<unsigned>(std::time(nullptr));
+  for (unsigned seed = now - 43200; seed <= now + 43200; ++seed) {
+    if (seededWith(seed)) {
+      return "the clock";
+    }
+  }
+  for (unsigned pid = 1; pid <= (1u << 17); ++pid) {  // the first 131072 process ids
+    if (seededWith(pid)) {
+      return pid == 1 ? "unseeded" : "a process id";
+    }
+  }
+  return "";
+}
+
+// A host that never seeds, one that seeds through the TPM and one that
+// seeds through the kernel (the TPM's draw failing) each get a key that is
+// unguessable and unlike the others, within one second. The search does find
+// keys from random() seeded the weak ways after the host's seeding, so it
+// proves something when it fails.
 TEST(KmmFlow, SeedKeyIsUnguessableWhetherOrNotTheHostSeeds) {
   srandom(1);  // a host's own weak seeding, without KmmSeedRandom
-  std::string digests[2];
-  for (std::string& digest : digests) {
+  std::set<std::string> digests;
+  for (const int seeding : {-1, KMM_ENTROPY_TPM, KMM_ENTROPY_GETRANDOM}) {
     Reset();
+    KeyManager().fail[kRandom] = seeding == KMM_ENTROPY_GETRANDOM;
+    EXPECT_TRUE(seeding < 0 || KmmSeedRandom() == seeding) << seeding;
     ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
-    digest = Text(kScDigestPath);
-    EXPECT_EQ(GuessSeedKey(digest, std::time(nullptr)), "");
+    digests.insert(Text(kScDigestPath));
+    EXPECT_EQ(SeedGuess(g_context), "") << seeding;
+    // random() still yields 31 bits: the top bit of each word's last byte is 0.
+    for (std::uint32_t at = 15; at < kmm::kSeedKeySize; at += 4) {
+      EXPECT_EQ(ProtectedKey_ByteAt(&g_context->seedKeyPK, at) & 0x80, 0) << at;
+    }
   }
-  EXPECT_NE(digests[0], digests[1]);
+  EXPECT_EQ(digests.size(), 3u);
   static std::array<char, 128> fresh;  // a generator as a process starts with
   for (unsigned int weak : {1u, static_cast<unsigned int>(std::time(nullptr)), 4321u}) {
     Reset();
     ASSERT_GE(KmmSeedRandom(), 0);
     initstate(weak, fresh.data(), fresh.size());  // what a host does after it is its own
     ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
-    EXPECT_NE(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "") << weak;
-  }
-  for (unsigned tpmFails : {0u, 1u}) {
-    Reset();
-    KeyManager().fail[kRandom] = tpmFails;
-    EXPECT_EQ(KmmSeedRandom(), tpmFails != 0 ? KMM_ENTROPY_GETRANDOM : KMM_ENTROPY_TPM);
-    ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
-    EXPECT_EQ(GuessSeedKey(Text(kScDigestPath), std::time(nullptr)), "");
-    // random() still yields 31 bits: the top bit of each word's last byte is 0.
-    for (std::uint32_t at = 15; at < kmm::kSeedKeySize; at += 4) {
-      EXPECT_EQ(ProtectedKey_ByteAt(&g_context->seedKeyPK, at) & 0x80, 0) << at;
-    }
+    EXPECT_NE(SeedGuess(g_context), "") << weak;
   }
 }
 

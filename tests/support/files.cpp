@@ -33,6 +33,15 @@ std::string Sha256(std::string_view bytes) {
   return digest;
 }
 
+std::string KeyAuth(std::string bytes) {
+  bytes.resize(20);
+  std::string hex = Hex(bytes), digest(16, '\0');
+  std::erase(hex, ' ');
+  EVP_Digest(hex.data(), hex.size(), reinterpret_cast<unsigned char*>(digest.data()), nullptr,
+             EVP_md5(), nullptr);
+  return digest;
+}
+
 void Require(bool holds) {
   if (!holds) {
     std::abort();

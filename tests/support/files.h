@@ -15,6 +15,11 @@ std::optional<std::string> ReadFile(const std::string& path);
 // the code under test uses.
 std::string Sha256(std::string_view bytes);
 
+// KeyAuth is what the key manager makes of the first 20 bytes of a key file
+// (zeros for what is missing) to name a TPM key or authorize it: the MD5 of
+// their upper-case hex text.
+std::string KeyAuth(std::string bytes);
+
 // Require ends the process when |holds| is false: a fuzz harness's check.
 void Require(bool holds);
 

@@ -26,8 +26,6 @@ void ResetDevice(std::uint8_t control, std::uint32_t sfeConf);
 // MakeEeprom writes a blank (0xFF) image at KEYMGR_EEPROM_PATH with the given
 // control byte and SFE CONF word (least significant byte first).
 void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf);
-std::vector<std::uint8_t> ReadEepromBytes(std::uint32_t offset, std::uint32_t length);
-void WriteEepromBytes(std::uint32_t offset, const std::vector<std::uint8_t>& bytes);
 
 struct RunResult {
   int status = -1;  // exit status, or -1 when the program did not exit normally
@@ -46,11 +44,6 @@ RunResult Run(const std::vector<std::string>& argv);
 std::vector<std::string> Traced(const std::vector<std::string>& options,
                                 const std::vector<std::string>& argv);
 
-// RunKilledAt runs argv, output discarded, and kills it with SIGKILL on entry
-// to its |n|th call of the system call |call|, before that call runs. Returns
-// true when it was killed there, false when it ended first.
-bool RunKilledAt(const std::string& call, int n, const std::vector<std::string>& argv);
-
 // SyncTrace runs argv under strace and sums up, in order, how it replaced
 // files: "F" an fsync of a file, "D" of a folder, "L" a link, "R:name" a
 // rename onto |name|.
@@ -63,10 +56,12 @@ std::string Output(const std::function<void()>& call);
 // its PCRs are reset, its persistent objects kept, and it is started.
 void PowerCycleTpm();
 
-// PersistentHandles lists the persistent handles of the TPM at |tcti| (the
-// suite's swtpm by default), as tpm2_getcap sees them. EvictAllBut evicts
-// every one that is not in |keep|.
-std::set<std::string> PersistentHandles(const std::string& tcti = "");
-void EvictAllBut(const std::set<std::string>& keep, const std::string& tcti = "");
+// Tpm2 runs the tpm2-tools program |argv|[0] on the suite's swtpm.
+RunResult Tpm2(std::vector<std::string> argv);
+
+// PersistentHandles lists the persistent handles of the suite's swtpm, as
+// tpm2_getcap sees them. EvictAllBut evicts every one that is not in |keep|.
+std::set<std::string> PersistentHandles();
+void EvictAllBut(const std::set<std::string>& keep);
 
 }  // namespace keymgr::test

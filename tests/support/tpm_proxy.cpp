@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <array>
+#include <tuple>
 #include <utility>
 
 namespace keymgr::test {
@@ -75,9 +76,7 @@ TpmProxy::~TpmProxy() {
 
 void TpmProxy::Arm(Fault fault, int nth, std::uint32_t code) {
   const std::lock_guard<std::mutex> guard(lock_);
-  fault_ = fault;
-  nth_ = nth;
-  code_ = code;
+  std::tie(fault_, nth_, code_) = std::tuple(fault, nth, code);
   sent_.clear();
   traffic_.clear();
 }

@@ -1,9 +1,13 @@
+#include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <sstream>
+#include <thread>
 
 #include "keymgr_build_config.h"
 #include "support/sandbox.h"
@@ -21,7 +25,8 @@ keymgr::test::RunResult Tool(const std::string& words) {
 
 // Numbers are decimal (a leading zero does not make octal) or 0x-prefixed hex.
 // Errors go to standard error with status 1 and change nothing; the second
-// init blanks the image again. The image is private to its owner.
+// init blanks the image again. The image is private to its owner, and a
+// write waits a while for the lock of a reader.
 TEST(KeymgrEepromTest, InitWriteReadAndErrors) {
   keymgr::test::ResetSandbox();
   const char* ok[][2] = {{"init", ""},
@@ -45,6 +50,22 @@ TEST(KeymgrEepromTest, InitWriteReadAndErrors) {
   struct stat st {};  // for its owner alone, whatever the umask
   ASSERT_EQ(::stat(KEYMGR_EEPROM_PATH, &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
+  // A reader's lock held on: a write gives up after its wait of a few seconds
+  // and leaves the image as it was. Released within the wait: it goes through.
+  const int holder = ::open(KEYMGR_EEPROM_PATH, O_RDONLY | O_CLOEXEC);
+  ASSERT_EQ(::flock(holder, LOCK_SH), 0);
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(Tool("write 32766 0102").status, 1);
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+  EXPECT_EQ(Tool("read 32766 2").out, "FF FF\n");
+  keymgr::test::RunResult late;
+  std::thread writer([&] { late = Tool("write 32766 0102"); });
+  ::usleep(300000);
+  ::close(holder);
+  writer.join();
+  EXPECT_EQ(late.status, 0) << late.err;
+  EXPECT_EQ(Tool("read 32766 2").out, "01 02\n");
   // A FIFO at the image's path fails at once instead of waiting for a reader.
   ASSERT_EQ(::unlink(KEYMGR_EEPROM_PATH), 0);
   ASSERT_EQ(::mkfifo(KEYMGR_EEPROM_PATH, 0600), 0);
