@@ -38,6 +38,7 @@ install(FILES dist/man/keymgr-mkdigest.1 dist/man/keymgr-eventlog.1
 # build installs them. A package build points KEYMGR_INITDIR at /etc/init.d.
 set(KEYMGR_UNITDIR "lib/systemd/system" CACHE STRING "Where the systemd unit is installed")
 set(KEYMGR_INITDIR "etc/init.d" CACHE STRING "Where the init script is installed")
+set(KEYMGR_BOOT_LOG "${KEYMGR_ROOT}/quorvan/spool/log/keymgr.log")
 configure_file(dist/keymgr-boot.service.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service @ONLY)
 configure_file(dist/keymgr-boot.init.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service DESTINATION ${KEYMGR_UNITDIR})

@@ -3,10 +3,11 @@
 # target architecture, into a sysroot folder:
 #   cross-sysroot.sh arm64|armhf DIR
 # The packages come from the machine's own Debian sources, read through a
-# private apt state, so the machine's package database is left alone (no
-# dpkg --add-architecture). The sysroot holds the target's own loader and C
-# library: the emulator takes DIR as its library prefix, and a program never
-# runs on a mix of the cross compiler's C library and another version of it.
+# private apt state (scripts/target-apt.sh), so the machine's package
+# database is left alone (no dpkg --add-architecture). The sysroot holds the
+# target's own loader and C library: the emulator takes DIR as its library
+# prefix, and a program never runs on a mix of the cross compiler's C library
+# and another version of it.
 # DIR/var/lib/dpkg is the sysroot's own dpkg database, which dpkg-shlibdeps
 # reads (DPKG_ADMINDIR) to find the packages a cross-built program needs.
 # DIR is unpacked anew only when a package version or DIR's place changes, so
@@ -23,46 +24,11 @@ packages=(
   libgtest-dev
 )
 
-sudo=""
-[ "$(id -u)" -eq 0 ] || sudo="sudo"
-
-# debian_sources prints "deb URI SUITE main" for each Debian suite the
-# machine's apt knows (only known once its indexes were fetched).
-debian_sources() {
-  # shellcheck disable=SC2016 # $(FIELD) is apt's own placeholder
-  apt-get indextargets --format 'deb $(REPO_URI) $(RELEASE) main' \
-    'Identifier: Packages' 'Origin: Debian' | sort -u
-}
-
+# shellcheck source=scripts/target-apt.sh
+. "$(dirname "$0")/target-apt.sh"
 apt_dir=$(mktemp -d)
 trap 'rm -rf "$apt_dir"' EXIT
-mkdir -p "$apt_dir"/lists/partial "$apt_dir"/cache/archives/partial "$apt_dir"/parts "$apt_dir"/debs
-: >"$apt_dir"/status
-if [ -z "$(debian_sources)" ]; then
-  $sudo apt-get update -q
-fi
-debian_sources >"$apt_dir"/sources.list
-[ -s "$apt_dir"/sources.list ] || { echo "no Debian package source is configured for apt" >&2; exit 1; }
-cat >"$apt_dir"/apt.conf <<EOF
-Dir::State "$apt_dir";
-Dir::State::Lists "$apt_dir/lists";
-Dir::State::status "$apt_dir/status";
-Dir::Cache "$apt_dir/cache";
-Dir::Etc::SourceList "$apt_dir/sources.list";
-Dir::Etc::SourceParts "$apt_dir/parts";
-APT::Architecture "$arch";
-APT::Architectures { "$arch"; };
-APT::Sandbox::User "root";
-EOF
-export APT_CONFIG=$apt_dir/apt.conf
-
-# An index that does not come (the security suite's for armhf, at times)
-# leaves the packages of the other suites, which make a sysroot that works
-# as well: nothing in it has to match the machine's own versions.
-if ! apt-get update -q >"$apt_dir"/update.log 2>&1; then
-  grep -E '^(E|W):' "$apt_dir"/update.log >&2 || true
-  echo "warning: some $arch package indexes did not come; using those that did" >&2
-fi
+target_apt "$arch" "$apt_dir"
 
 # The database names files by where they lie (see record_package): the
 # stamp holds DIR's place with the package files.

@@ -9,13 +9,15 @@
 #                                cross build in build-TARGET/ against the target's
 #                                Debian libraries (build-TARGET/sysroot), tests
 #                                run under qemu-user, root /tmp/keymgr-test-TARGET
+#   scripts/test.sh --vm         the aarch64 device build booted on an ARM kernel
+#                                under qemu-system (scripts/vm-test.sh)
 # KEYMGR_TEST_ROOT overrides the sandbox root (at most 35 characters; --sanitize
 # and --tsan add -asan and -tsan to it).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 usage() {
-  echo "usage: $0 [--sanitize | --tsan | --target aarch64|armhf]" >&2
+  echo "usage: $0 [--sanitize | --tsan | --target aarch64|armhf | --vm]" >&2
   exit 2
 }
 
@@ -70,6 +72,7 @@ case "${1:-}" in
     extra=("${cross_args[@]}")
     register_binfmt "$cpu"
     ;;
+  --vm) exec bash scripts/vm-test.sh ;;
   *) usage ;;
 esac
 # A cross build has installed what it needs along with its cross compiler.
