@@ -9,6 +9,8 @@
 #   vmtest_row=NAME             the row (see the case at the end; "shell"
 #                               gives a shell after the boot script)
 #   vmtest_tcti=TCTI            provision: the transport kmm-host was built for
+#   vmtest_sealed=1             the build measures its verdict into PCR 14 and
+#                               seals the key to it
 #   vmtest_cut=I vmtest_cuts=N  cut rows: cut the power at point I of N
 #   vmtest_op=kmm|hash          cut rows: the operation to cut
 #   vmtest_finished=1           cut rows: the host saw the previous boot's
@@ -31,6 +33,8 @@ cut_index=${vmtest_cut:-0}
 cut_count=${vmtest_cuts:-1}
 finished=${vmtest_finished:-}
 vmtest_tcti=${vmtest_tcti:-}
+sealed=${vmtest_sealed:-}
+events=/quorvan/spool/log/keymgr.events
 hidden=/quorvan/hidden
 log=/quorvan/spool/log/keymgr.log
 # What the test keeps on the disk between boots, beside /quorvan.
@@ -419,19 +423,34 @@ case "$row" in
     check "keymgr.cb holds a record per listed file" \
       [ "$(wc -c <"$hidden/keymgr.cb")" = $((32 * $(wc -w <"$hidden/keymgr.list"))) ]
     keys_are "before the first regeneration" ""
-    regenerate_and_boot
+    if [ -n "$sealed" ]; then
+      # This boot measured a verdict of nothing: the key opens only after
+      # the next boot's good verdict.
+      run "regeneration (kmm-host 3)" 0 kmm-host 3
+      run "boot proof (kmm-host 1 1) before a good verdict" 1 kmm-host 1 1
+    else
+      regenerate_and_boot
+    fi
     ;;
   normal)
     run_boot_script
     boot_status_is 0
     log_is BN=OK DT=OK
+    [ -z "$sealed" ] || check "the event log holds the verdict BN=OK" grep -q '"verdict":"BN=OK"' "$events"
     ;;
   file-altered)
     cp /quorvan/protected/device.conf /tmp/device.conf
     echo "altered" >>/quorvan/protected/device.conf
     run_boot_script
-    boot_status_is 0
-    log_is BN=FAIL DT=OK
+    if [ -n "$sealed" ]; then
+      # The key needs the good verdict.
+      boot_status_is 1
+      log_is BN=FAIL DT=FAIL
+      check "the event log holds the verdict BN=FAIL" grep -q '"verdict":"BN=FAIL"' "$events"
+    else
+      boot_status_is 0
+      log_is BN=FAIL DT=OK
+    fi
     cp /tmp/device.conf /quorvan/protected/device.conf
     ;;
   key-altered)

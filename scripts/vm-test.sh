@@ -13,7 +13,8 @@
 # file altered, an unreadable EEPROM, a fresh TPM, a regeneration over the
 # key, a kernel panic during the boot proof and the boot after it; all with
 # the default transport device:/dev/tpmrm0, then again with a kmm-host built
-# for device:/dev/tpm0. Then power cuts: the guest cuts its own power
+# for device:/dev/tpm0, and a few with the verdict measured into PCR 14 and
+# the key sealed to it. Then power cuts: the guest cuts its own power
 # (sysrq b: no sync) part way through kmm-host 3, and through keymgr hash
 # over a few thousand files, at KEYMGR_VM_CUTS points each (20 by default);
 # each next boot checks what the cut left. Last, e2fsck -n on the disks and
@@ -37,14 +38,28 @@ mkdir -p "$build"
 build=$(realpath "$build")
 sysroot=$PWD/$package/sysroot
 
-# --- kmm-host for device:/dev/tpm0 ------------------------------------------
-# The device build's options with the other transport; only kmm-host, which
-# holds the module, differs.
-cmake -S . -B "$build/tpm0" -G Ninja -DCMAKE_BUILD_TYPE=MinSizeRel -DBUILD_TESTING=OFF \
-  -DKEYMGR_ROOT= -DCMAKE_INSTALL_PREFIX=/usr --toolchain cmake/toolchains/aarch64-linux-gnu.cmake \
-  -DKEYMGR_SYSROOT="$sysroot" -DKEYMGR_TCTI=device:/dev/tpm0 >/dev/null
-cmake --build "$build/tpm0" --target kmm-host -j 2
-aarch64-linux-gnu-strip -o "$build/kmm-host-tpm0" "$build/tpm0/tools/kmm-host"
+# --- Other builds of the device's programs ----------------------------------
+# variant NAME TARGETS OPTIONS...: the device build's options and OPTIONS,
+# its TARGETS stripped into $build/NAME/usr/bin, to lay over the image.
+variant() {
+  local name=$1 targets=$2 target
+  shift 2
+  cmake -S . -B "$build/$name-build" -G Ninja -DCMAKE_BUILD_TYPE=MinSizeRel -DBUILD_TESTING=OFF \
+    -DKEYMGR_ROOT= -DKEYMGR_REDACT_OOK=ON -DCMAKE_INSTALL_PREFIX=/usr \
+    --toolchain cmake/toolchains/aarch64-linux-gnu.cmake -DKEYMGR_SYSROOT="$sysroot" "$@" >/dev/null
+  # shellcheck disable=SC2086 # one word per target
+  cmake --build "$build/$name-build" --target $targets -j 2
+  rm -rf "${build:?}/$name"
+  mkdir -p "$build/$name/usr/bin"
+  for target in $targets; do
+    aarch64-linux-gnu-strip -o "$build/$name/usr/bin/$target" \
+      "$(find "$build/$name-build" -type f -name "$target" -perm -u+x | head -n 1)"
+  done
+}
+# kmm-host for device:/dev/tpm0: only kmm-host holds the module.
+variant tpm0 kmm-host -DKEYMGR_TCTI=device:/dev/tpm0
+# The verdict measured into PCR 14 and the key sealed to it.
+variant sealed "keymgr kmm-host" -DKEYMGR_MEASURE_PCR=14 -DKEYMGR_SEAL_TO_VERDICT=ON
 
 # --- Kernel and busybox -----------------------------------------------------
 tmp=$(mktemp -d)
@@ -110,7 +125,7 @@ add_library() {
   for need in $(needed "$found"); do add_library "$need"; done
 }
 needed() { readelf -d "$1" | sed -n 's/.*(NEEDED).*\[\(.*\)\]/\1/p'; }
-for program in "$root"/usr/bin/* "$build/kmm-host-tpm0"; do
+for program in "$root"/usr/bin/* "$build"/{tpm0,sealed}/usr/bin/*; do
   for need in $(needed "$program"); do add_library "$need"; done
 done
 add_library libtss2-tcti-device.so.0
@@ -134,13 +149,11 @@ for module in virtio_mmio virtio_blk tpm_tis; do add_module "$module"; done
 
 # Uncompressed: the guest unpacks it faster than it would decompress it.
 (cd "$root" && find . | LC_ALL=C sort | cpio -o -H newc -R 0:0 --quiet) >"$build/initrd-tpmrm0"
-# The tpm0 image: the same with the other kmm-host laid over it.
-overlay=$build/overlay
-rm -rf "$overlay"
-mkdir -p "$overlay/usr/bin"
-cp "$build/kmm-host-tpm0" "$overlay/usr/bin/kmm-host"
-(cd "$overlay" && find . | LC_ALL=C sort | cpio -o -H newc -R 0:0 --quiet) >"$tmp/overlay"
-cat "$build/initrd-tpmrm0" "$tmp/overlay" >"$build/initrd-tpm0"
+# The tpm0 and sealed images: the same with their programs laid over it.
+for name in tpm0 sealed; do
+  (cd "$build/$name" && find . | LC_ALL=C sort | cpio -o -H newc -R 0:0 --quiet) >"$tmp/overlay"
+  cat "$build/initrd-tpmrm0" "$tmp/overlay" >"$build/initrd-$name"
+done
 
 # --- Disks ------------------------------------------------------------------
 # make_disk IMAGE: an ext4 image with /quorvan (the protected files and a few
@@ -289,6 +302,18 @@ rows() {
 rows tpmrm0 "$build/initrd-tpmrm0"
 rows tpm0 "$build/initrd-tpm0"
 after_series tpm0 "$build/disk-tpm0.img" "$build/tpm-tpm0"
+
+echo "== The verdict measured into PCR 14 and the key sealed to it, on device:/dev/tpmrm0"
+disk=$build/disk-sealed.img
+state=$build/tpm-sealed
+make_disk "$disk"
+rm -rf "$state"
+boot sealed-provision "$state" "$disk" "$build/initrd-sealed" vmtest_row=provision \
+  vmtest_tcti=device:/dev/tpmrm0 vmtest_sealed=1
+boot sealed-normal "$state" "$disk" "$build/initrd-sealed" vmtest_row=normal vmtest_sealed=1
+boot sealed-file-altered "$state" "$disk" "$build/initrd-sealed" vmtest_row=file-altered \
+  vmtest_sealed=1
+boot sealed-after "$state" "$disk" "$build/initrd-sealed" vmtest_row=normal vmtest_sealed=1
 
 echo "== Power cuts, $cuts points through kmm-host 3 and through keymgr hash"
 disk=$build/disk-tpmrm0.img
