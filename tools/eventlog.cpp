@@ -64,10 +64,13 @@ bool ReadRecord(const std::string& line, unsigned* pcr, PcrValue* digest, std::s
     return false;
   }
   for (std::size_t i = 0; i < digest->size(); ++i) {
-    (*digest)[i] = static_cast<std::uint8_t>(std::strtoul(hex.substr(2 * i, 2).c_str(), &end, 16));
-    if (*end != '\0') {
+    // Two hex digits exactly: strtoul alone would take a sign or a blank.
+    const char pair[3] = {hex[2 * i], hex[2 * i + 1], '\0'};
+    if (std::isxdigit(static_cast<unsigned char>(pair[0])) == 0 ||
+        std::isxdigit(static_cast<unsigned char>(pair[1])) == 0) {
       return false;
     }
+    (*digest)[i] = static_cast<std::uint8_t>(std::strtoul(pair, nullptr, 16));
   }
   return true;
 }
