@@ -20,8 +20,11 @@ cmake -S . -B "$build" -G Ninja -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=cl
   -DKEYMGR_FUZZ=ON -DBUILD_TESTING=OFF -DKEYMGR_ROOT="$root"
 cmake --build "$build" -j "$(nproc)"
 
-for harness in "$build"/fuzz/fuzz_*; do
-  name=${harness##*/fuzz_}
+# Each harness has its seeds; a harness left in the build folder by an older
+# tree has none and is not run.
+for corpus in tests/fuzz/corpus/*/; do
+  name=$(basename "$corpus")
+  harness=$build/fuzz/fuzz_$name
   mkdir -p "$build/corpus/$name"
   echo "== fuzz_$name, ${seconds} s"
   "$harness" -max_total_time="$seconds" -timeout=10 -print_final_stats=1 \
