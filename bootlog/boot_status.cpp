@@ -82,12 +82,9 @@ void WriteBootStatus(unsigned int code) {
   if (code <= kLastStatusCode) {
     const StatusLine& line = kStatusLines[code];
     DebugPrint("%s", line.text);
-    const auto write = [&](std::size_t done, std::size_t left) {
-      return ::write(log.get(), line.text + done, left);
-    };
     // The boot script reads the outcome from here only: a line that did not
     // reach the file is named on request, though its result stays as it was.
-    if (!keymgr::MoveAll(write, line.length)) {
+    if (!keymgr::WriteAll(log.get(), line.text, line.length)) {
       (void)keymgr::ErrnoFailure("write");
     }
   } else {

@@ -1,7 +1,6 @@
 #include "cli/measure.h"
 
 #include <fcntl.h>
-#include <unistd.h>
 
 #include <array>
 #include <cstdint>
@@ -19,23 +18,14 @@ namespace keymgr::cli {
 
 namespace {
 
-// HexOf writes the 64 hex digits of |digest| and a NUL at |text|.
-void HexOf(const std::array<std::uint8_t, 32>& digest, char (&text)[65]) {
-  for (std::size_t i = 0; i < digest.size(); ++i) {
-    (void)std::snprintf(text + 2 * i, 3, "%02x", digest[i]);
-  }
-}
-
 // FileField appends ,"NAME":"SHA-256 of PATH" to |content| when the file
 // can be hashed.
 void FileField(const char* name, const char* path, char* content, std::size_t size,
                std::size_t* used) {
   std::array<std::uint8_t, kFileDigestSize> digest{};
-  char hex[65];
   if (*used < size && ComputeFileDigest(path, digest).ok()) {
-    HexOf(digest, hex);
-    *used += static_cast<std::size_t>(
-        std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"", name, hex));
+    *used += static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"",
+                                                    name, tpm::DigestHex(digest).data()));
   }
 }
 
@@ -79,23 +69,19 @@ void MeasureVerdict(unsigned pcr, tpm::Verdict verdict) {
     FileField("digests_sha256", kDigestFilePath, content, sizeof(content), &used);
     ReleaseField(content, sizeof(content), &used);
   }
-  char hex[65];
-  HexOf(digest, hex);
   char line[768];
   const int length =
       std::snprintf(line, sizeof(line),
                     "{\"recnum\":0,\"pcr\":%u,\"digests\":[{\"hashAlg\":\"sha256\","
                     "\"digest\":\"%s\"}],\"content_type\":\"keymgr\",\"content\":%s}}\n",
-                    pcr, hex, content);
+                    pcr, tpm::DigestHex(digest).data(), content);
   // The log lies beside the status log and is kept with the same care. A
   // failed extend leaves it empty, so that it never claims an event the PCR
   // does not hold.
   const Descriptor log =
       OpenRegular(kEventLogPath, O_WRONLY | O_CREAT | O_TRUNC, nullptr, Look::kOwnName);
-  const auto write = [&](std::size_t done, std::size_t left) {
-    return ::write(log.get(), line + done, left);
-  };
-  if (!log || (extended && length > 0 && !MoveAll(write, static_cast<std::size_t>(length)))) {
+  if (!log ||
+      (extended && length > 0 && !WriteAll(log.get(), line, static_cast<std::size_t>(length)))) {
     (void)ErrnoFailure("event log");
   }
 }

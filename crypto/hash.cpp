@@ -40,4 +40,14 @@ Status Sha256::Final(std::span<std::uint8_t, kSha256Size> digest) {
   return failed_;
 }
 
+std::array<std::uint8_t, kSha256Size> Sha256Of(std::span<const std::uint8_t> bytes) {
+  std::array<std::uint8_t, kSha256Size> digest{};
+  Sha256 sha;
+  (void)sha.Update(bytes.data(), bytes.size());
+  if (!sha.Final(digest).ok()) {
+    digest.fill(0);
+  }
+  return digest;
+}
+
 }  // namespace keymgr::crypto

@@ -3,6 +3,7 @@
 
 #include <openssl/evp.h>
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <span>
@@ -31,5 +32,9 @@ class Sha256 {
   Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context_;
   Status failed_;  // the first failure, kept until Final
 };
+
+// Sha256Of is the SHA-256 of |bytes|; all zeros should libcrypto fail, which
+// no comparison of real data matches by chance.
+std::array<std::uint8_t, kSha256Size> Sha256Of(std::span<const std::uint8_t> bytes);
 
 }  // namespace keymgr::crypto

@@ -25,16 +25,6 @@ std::uint64_t GetBig(const std::uint8_t* at, int bytes) {
   return value;
 }
 
-std::array<std::uint8_t, 32> Sha256Of(std::span<const std::uint8_t> bytes) {
-  std::array<std::uint8_t, 32> digest{};
-  crypto::Sha256 sha;
-  (void)sha.Update(bytes.data(), bytes.size());
-  if (!sha.Final(digest).ok()) {
-    digest.fill(0);  // no file hashes to it, so nothing checks against it
-  }
-  return digest;
-}
-
 }  // namespace
 
 void EncodeSignatureFile(const SignatureFile& file,
@@ -63,7 +53,7 @@ Status DecodeSignatureFile(std::span<const std::uint8_t> bytes, SignatureFile* f
 }
 
 std::array<std::uint8_t, 8> KeyIdOf(const PublicKey& key) {
-  const auto digest = Sha256Of(key);
+  const auto digest = crypto::Sha256Of(key);
   std::array<std::uint8_t, 8> id{};
   std::memcpy(id.data(), digest.data(), id.size());
   return id;
@@ -82,7 +72,8 @@ Status CheckSignatureFile(std::span<const std::uint8_t> bytes, const PublicKey& 
   if (file.keyId != KeyIdOf(key)) {
     return Refused("signature file of another key");
   }
-  if (file.listDigest != Sha256Of(manifest) || file.digestsDigest != Sha256Of(digests)) {
+  if (file.listDigest != crypto::Sha256Of(manifest) ||
+      file.digestsDigest != crypto::Sha256Of(digests)) {
     return Refused("signature file of another manifest or digest file");
   }
   if (Status status = crypto::Ed25519Verify(key, bytes.first(kSignedSize),

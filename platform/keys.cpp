@@ -64,11 +64,7 @@ void PutBig32(crypto::Sha256& sha, uint32_t value) {
 // nothing that a regeneration or an update changes, so it marks the keys of
 // this system as well.
 TPM2B_DIGEST VerdictPolicy(int pcr) {
-  std::array<uint8_t, 32> pcrDigest{};
-  const PcrValue good = GoodPcrValue();
-  crypto::Sha256 values;
-  (void)values.Update(good.data(), good.size());
-  (void)values.Final(pcrDigest);
+  const std::array<uint8_t, 32> pcrDigest = crypto::Sha256Of(GoodPcrValue());
   std::array<uint8_t, sizeof(TPML_PCR_SELECTION)> selection{};
   std::size_t size = 0;
   const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);

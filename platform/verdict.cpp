@@ -20,15 +20,27 @@ PcrValue VerdictDigest(Verdict verdict) {
   return digest;
 }
 
-PcrValue GoodPcrValue() {
-  const PcrValue zeros{};
-  const PcrValue good = VerdictDigest(Verdict::kOk);
+PcrValue Extended(const PcrValue& pcr, const PcrValue& digest) {
   PcrValue value{};
   crypto::Sha256 sha;
-  (void)sha.Update(zeros.data(), zeros.size());
-  (void)sha.Update(good.data(), good.size());
+  (void)sha.Update(pcr.data(), pcr.size());
+  (void)sha.Update(digest.data(), digest.size());
   (void)sha.Final(value);
   return value;
+}
+
+PcrValue GoodPcrValue() {
+  return Extended(PcrValue{}, VerdictDigest(Verdict::kOk));
+}
+
+std::array<char, 65> DigestHex(const PcrValue& digest) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  std::array<char, 65> text{};
+  for (std::size_t i = 0; i < digest.size(); ++i) {
+    text[2 * i] = kDigits[digest[i] >> 4];
+    text[2 * i + 1] = kDigits[digest[i] & 15];
+  }
+  return text;
 }
 
 }  // namespace keymgr::tpm

@@ -17,11 +17,19 @@ using PcrValue = std::array<std::uint8_t, 32>;
 // BN=FAIL, or "none" for a run that verified nothing.
 PcrValue VerdictDigest(Verdict verdict);
 
+// Extended is the value of a SHA-256 PCR at |pcr| once extended with
+// |digest|.
+PcrValue Extended(const PcrValue& pcr, const PcrValue& digest);
+
 // GoodPcrValue is the value of a PCR reset to zeros (PCRs 0-15 at power on)
 // extended once with the good verdict's digest.
 PcrValue GoodPcrValue();
 
 // VerdictName is the verdict as the event log names it.
 const char* VerdictName(Verdict verdict);
+
+// DigestHex is |digest| in lower-case hex with a terminating NUL, as the
+// event log writes digests.
+std::array<char, 65> DigestHex(const PcrValue& digest);
 
 }  // namespace keymgr::tpm

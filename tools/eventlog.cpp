@@ -15,7 +15,6 @@
 #include <map>
 #include <string>
 
-#include "crypto/hash.h"
 #include "platform/verdict.h"
 #include "util/owned.h"
 
@@ -30,12 +29,7 @@ int Fail(const std::string& what) {
 }
 
 std::string Hex(const PcrValue& value) {
-  std::string text;
-  for (std::uint8_t byte : value) {
-    text += "0123456789abcdef"[byte >> 4];
-    text += "0123456789abcdef"[byte & 15];
-  }
-  return text;
+  return keymgr::tpm::DigestHex(value).data();
 }
 
 // Field returns the text of |name|'s value in |line|: up to the next quote
@@ -106,11 +100,7 @@ int main(int argc, char** argv) {
       return Fail("line " + std::to_string(number) + ": the digest is not that of its verdict");
     }
     std::printf("%d pcr %u sha256:%s %s\n", number - 1, pcr, Hex(digest).c_str(), verdict.c_str());
-    PcrValue& value = pcrs[pcr];
-    keymgr::crypto::Sha256 sha;
-    (void)sha.Update(value.data(), value.size());
-    (void)sha.Update(digest.data(), digest.size());
-    (void)sha.Final(value);
+    pcrs[pcr] = keymgr::tpm::Extended(pcrs[pcr], digest);
   }
   for (const auto& [pcr, value] : pcrs) {
     std::printf("pcr %u replays to sha256:%s\n", pcr, Hex(value).c_str());

@@ -157,11 +157,8 @@ bool ReadAll(const std::string& path, std::string& bytes) {
 }
 
 std::array<std::uint8_t, 32> Sha256Of(const std::string& bytes) {
-  std::array<std::uint8_t, 32> digest{};
-  keymgr::crypto::Sha256 sha;
-  (void)sha.Update(bytes.data(), bytes.size());
-  (void)sha.Final(digest);
-  return digest;
+  return keymgr::crypto::Sha256Of(
+      {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
 }
 
 // Sign lays out keymgr.sig for |manifest| and |digests| in |bytes|, signed

@@ -92,10 +92,7 @@ void AtomicFile::Write(const void* bytes, std::size_t size) {
 }
 
 Status AtomicFile::Flush() {
-  const auto write = [&](std::size_t done, std::size_t left) {
-    return ::write(fd_.get(), buffer_.data() + done, left);
-  };
-  if (failed_.ok() && !MoveAll(write, used_)) {
+  if (failed_.ok() && !WriteAll(fd_.get(), buffer_.data(), used_)) {
     failed_ = ErrnoFailure("write");
   }
   OPENSSL_cleanse(buffer_.data(), used_);

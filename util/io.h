@@ -1,7 +1,8 @@
-// A loop for system calls that may move fewer bytes than asked.
+// Loops for system calls that may move fewer bytes than asked.
 #pragma once
 
 #include <sys/types.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstddef>
@@ -26,6 +27,14 @@ bool MoveAll(Io io, std::size_t size) {
     done += static_cast<std::size_t>(moved);
   }
   return true;
+}
+
+// WriteAll writes the |size| bytes at |bytes| to |fd|; false with errno
+// when they could not all be written.
+inline bool WriteAll(int fd, const void* bytes, std::size_t size) {
+  const auto* at = static_cast<const char*>(bytes);
+  return MoveAll([&](std::size_t done, std::size_t left) { return ::write(fd, at + done, left); },
+                 size);
 }
 
 }  // namespace keymgr
