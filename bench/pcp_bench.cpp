@@ -10,7 +10,7 @@
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/bytes.h"
 
 namespace {

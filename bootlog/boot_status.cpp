@@ -9,8 +9,8 @@
 #include <cstring>
 #include <iterator>
 
-#include "platform/eeprom.h"
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom.h"
+#include "eeprom/eeprom_map.h"
 #include "util/debug_print.h"
 #include "util/io.h"
 #include "util/owned.h"

@@ -12,10 +12,10 @@
 #ifdef KEYMGR_MEASURE_PCR
 #include "cli/measure.h"
 #endif
+#include "eeprom/eeprom.h"
+#include "eeprom/eeprom_map.h"
 #include "integrity/manifest.h"
 #include "keymgr_build_config.h"
-#include "platform/eeprom.h"
-#include "platform/eeprom_map.h"
 #include "util/debug_print.h"
 
 namespace {
@@ -65,7 +65,7 @@ int main(int argc, char** argv) {
   }
 #ifdef KEYMGR_MEASURE_PCR
   // One event a boot run: the verdict, or that nothing was verified.
-  using keymgr::tpm::Verdict;
+  using keymgr::verdict::Verdict;
   const int result = enabled == 1 ? VerifyManifest(command.verbose) : 0;
   const int verdict = enabled == 1 ? LastBootVerdict() : -1;
   keymgr::cli::MeasureVerdict(KEYMGR_MEASURE_PCR, verdict == 0   ? Verdict::kOk

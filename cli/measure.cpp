@@ -8,7 +8,7 @@
 
 #include "crypto/file_digest.h"
 #include "integrity/signature.h"
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"
@@ -25,7 +25,7 @@ void FileField(const char* name, const char* path, char* content, std::size_t si
   std::array<std::uint8_t, kFileDigestSize> digest{};
   if (*used < size && ComputeFileDigest(path, digest).ok()) {
     *used += static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"",
-                                                    name, tpm::DigestHex(digest).data()));
+                                                    name, verdict::DigestHex(digest).data()));
   }
 }
 
@@ -52,8 +52,8 @@ void ReleaseField(char* content, std::size_t size, std::size_t* used) {
 
 }  // namespace
 
-void MeasureVerdict(unsigned pcr, tpm::Verdict verdict) {
-  const tpm::PcrValue digest = tpm::VerdictDigest(verdict);
+void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
+  const verdict::PcrValue digest = verdict::VerdictDigest(verdict);
   const bool extended = pcp_extend_pcr(pcr, digest.data()) == 0;
   if (!extended) {
     (void)Refused("extend of the boot verdict");
@@ -62,9 +62,9 @@ void MeasureVerdict(unsigned pcr, tpm::Verdict verdict) {
   // record a line. What it names beside the verdict is for a verifier; only
   // the verdict is measured.
   char content[512];
-  std::size_t used = static_cast<std::size_t>(
-      std::snprintf(content, sizeof(content), "{\"verdict\":\"%s\"", tpm::VerdictName(verdict)));
-  if (verdict != tpm::Verdict::kNone) {
+  std::size_t used = static_cast<std::size_t>(std::snprintf(
+      content, sizeof(content), "{\"verdict\":\"%s\"", verdict::VerdictName(verdict)));
+  if (verdict != verdict::Verdict::kNone) {
     FileField("manifest_sha256", kManifestPath, content, sizeof(content), &used);
     FileField("digests_sha256", kDigestFilePath, content, sizeof(content), &used);
     ReleaseField(content, sizeof(content), &used);
@@ -74,7 +74,7 @@ void MeasureVerdict(unsigned pcr, tpm::Verdict verdict) {
       std::snprintf(line, sizeof(line),
                     "{\"recnum\":0,\"pcr\":%u,\"digests\":[{\"hashAlg\":\"sha256\","
                     "\"digest\":\"%s\"}],\"content_type\":\"keymgr\",\"content\":%s}}\n",
-                    pcr, tpm::DigestHex(digest).data(), content);
+                    pcr, verdict::DigestHex(digest).data(), content);
   // The log lies beside the status log and is kept with the same care. A
   // failed extend leaves it empty, so that it never claims an event the PCR
   // does not hold.

@@ -1,7 +1,7 @@
 // The boot verdict measured into the TPM, in a build with KEYMGR_MEASURE_PCR.
 #pragma once
 
-#include "platform/verdict.h"
+#include "verdict/verdict.h"
 
 namespace keymgr::cli {
 
@@ -9,6 +9,6 @@ namespace keymgr::cli {
 // the event log anew with the record of that one event. A failed extend
 // leaves the log empty and is named with KEYMGR_DEBUG; it changes nothing
 // else.
-void MeasureVerdict(unsigned pcr, tpm::Verdict verdict);
+void MeasureVerdict(unsigned pcr, verdict::Verdict verdict);
 
 }  // namespace keymgr::cli

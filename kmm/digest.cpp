@@ -2,8 +2,8 @@
 #include <array>
 #include <cstdint>
 
+#include "eeprom/eeprom.h"
 #include "kmm/internal.h"
-#include "platform/eeprom.h"
 #include "util/debug_print.h"
 
 using namespace keymgr::kmm;

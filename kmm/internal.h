@@ -9,7 +9,7 @@
 #include <cstdint>
 
 #include "crypto/dtc.h"
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom_map.h"
 #include "util/owned.h"
 
 namespace keymgr::kmm {

@@ -5,7 +5,7 @@
 #include <cstring>
 
 #include "kmm/internal.h"
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/debug_print.h"
 #include "util/secure.h"
 

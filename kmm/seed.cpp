@@ -11,7 +11,7 @@
 
 #include "crypto/hash.h"
 #include "kmm/internal.h"
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/random.h"
 #include "util/secure.h"
 

@@ -3,8 +3,8 @@
 #include <array>
 #include <cstring>
 
+#include "eeprom/eeprom.h"
 #include "kmm/internal.h"
-#include "platform/eeprom.h"
 #include "util/atomic_file.h"
 #include "util/debug_print.h"
 #include "util/paths.h"

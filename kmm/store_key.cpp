@@ -9,7 +9,7 @@
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
 #include "kmm/internal.h"
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/atomic_file.h"
 #include "util/bytes.h"
 #include "util/debug_print.h"
@@ -228,4 +228,23 @@ int DecryptStoreKey(KeyContext* context) {
   }
   DebugPrint("ST Key is decrypted!!\n");
   return 0;
+}
+
+extern "C" int KmmListKeys(uint32_t* handles, int capacity, uint32_t* named) {
+  if (named == nullptr || capacity < 0 || (handles == nullptr && capacity != 0)) {
+    return -1;
+  }
+  *named = 0;
+  TpmSecret identity;
+  TpmSecretHex nameHex;
+  if (ReadKeyFile(keymgr::kKeyIdPath, identity.data(), kTpmSecretSize)) {
+    HexOf(identity, nameHex);
+    *named = pcp_key_handle(nameHex.c_str());
+  }
+  std::uint32_t count = 0;
+  if (pcp_list_keys(handles, static_cast<std::uint32_t>(capacity), &count) != 0 ||
+      count > INT32_MAX) {
+    return -1;
+  }
+  return static_cast<int>(count);
 }

@@ -1,20 +1,21 @@
 #!/usr/bin/env bash
 # Fails when a source of the product includes a header of a higher layer, or
 # of a peer on its own layer. The layers, bottom up:
-#   0 util        bytes, hex, scope guards, secrets, status, owned handles
+#   0 util        bytes, hex, endian, scope guards, secrets, status, owned handles
 #   1 crypto      hashing and the crypto services
-#   2 platform    EEPROM and TPM
-#   3 bootlog     the boot status log and the security-feature test
-#   4 integrity   the manifest          4 kmm     the key-management module
-#   5 cli         the keymgr driver     5 tools   kmm-host, keymgr-eeprom, and bench
+#   2 verdict     the boot verdict's measurement and its event log
+#   3 eeprom      the EEPROM library    3 tpm     the platform key manager
+#   4 bootlog     the boot status log and the security-feature test
+#   5 integrity   the manifest          5 kmm     the key-management module
+#   6 cli         the keymgr driver     6 tools   kmm-host, keymgr-eeprom, and bench
 # Headers are included as "folder/header.h". The public C header <kmm/kmm.h>
 # is the interface the whole module is built on; it includes nothing of the
 # project and may be included from any layer.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
-declare -A rank=([util]=0 [crypto]=1 [platform]=2 [bootlog]=3 [integrity]=4 [kmm]=4
-                 [cli]=5 [tools]=5 [bench]=5)
+declare -A rank=([util]=0 [crypto]=1 [verdict]=2 [eeprom]=3 [tpm]=3 [bootlog]=4 [integrity]=5
+                 [kmm]=5 [cli]=6 [tools]=6 [bench]=6)
 status=0
 for dir in "${!rank[@]}"; do
   while IFS= read -r hit; do

@@ -237,7 +237,7 @@ boot() {
 
 # host_keys STATE: the keys of this system in a powered-off TPM's state, as
 # tpm2-tools on the host see them: persistent handles from 0x81020000 to
-# 0x817fffff whose authPolicy is the marker (platform/keys.cpp), counted
+# 0x817fffff whose authPolicy is the marker (tpm/keys.cpp), counted
 # apart from the guest's own count.
 host_keys() {
   local sock=$build/run/host.sock tcti handle count=0 pid

@@ -45,6 +45,16 @@ bool Decode(const char* hex, std::size_t length, std::span<std::uint8_t> bytes) 
   return true;
 }
 
+// FindRegion gives the region of the EEPROM map named |name|, or null.
+const eeprom::Region* FindRegion(const char* name) {
+  for (const eeprom::Region& region : eeprom::kRegions) {
+    if (std::strcmp(region.name, name) == 0) {
+      return &region;
+    }
+  }
+  return nullptr;
+}
+
 }  // namespace
 
 EepromArgs ParseEepromArgs(int argc, const char* const* argv,
@@ -53,6 +63,14 @@ EepromArgs ParseEepromArgs(int argc, const char* const* argv,
   EepromArgs args;
   if (argc == 2 && std::strcmp(argv[1], "init") == 0) {
     args.action = Action::kInit;
+    return args;
+  }
+  // A region by name stands for its offset, and for a read its length too.
+  const eeprom::Region* region = argc >= 3 ? FindRegion(argv[2]) : nullptr;
+  if (region != nullptr && argc == 3 && std::strcmp(argv[1], "read") == 0) {
+    args.action = Action::kRead;
+    args.offset = region->offset;
+    args.length = region->length;
     return args;
   }
   if (argc != 4) {
@@ -69,7 +87,13 @@ EepromArgs ParseEepromArgs(int argc, const char* const* argv,
   }
   if (std::strcmp(argv[1], "write") == 0) {
     const std::size_t digits = std::strlen(argv[3]);
-    if (!ParseNumber(argv[2], &args.offset) || digits == 0 || digits % 2 != 0) {
+    if (region != nullptr) {
+      args.offset = region->offset;
+    } else if (!ParseNumber(argv[2], &args.offset)) {
+      return EepromArgs();
+    }
+    // A region takes exactly its own length.
+    if (digits == 0 || digits % 2 != 0 || (region != nullptr && digits != 2 * region->length)) {
       return EepromArgs();
     }
     args.action = Action::kWrite;

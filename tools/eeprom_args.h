@@ -5,7 +5,7 @@
 #include <cstdint>
 #include <span>
 
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom_map.h"
 
 namespace keymgr::tools {
 
@@ -18,10 +18,11 @@ struct EepromArgs {
   std::size_t length = 0;
 };
 
-// ParseEepromArgs reads "init", "read OFFSET LENGTH" or "write OFFSET HEX",
-// OFFSET and LENGTH decimal or 0x-prefixed hexadecimal, HEX pairs of hex
-// digits of either case, which are decoded into |bytes|. Anything else is a
-// usage error.
+// ParseEepromArgs reads "init", "read OFFSET LENGTH", "read REGION",
+// "write OFFSET HEX" or "write REGION HEX", OFFSET and LENGTH decimal or
+// 0x-prefixed hexadecimal, REGION a name of eeprom::kRegions, HEX pairs of
+// hex digits of either case (for a region, exactly its length), which are
+// decoded into |bytes|. Anything else is a usage error.
 EepromArgs ParseEepromArgs(int argc, const char* const* argv,
                            std::span<std::uint8_t, eeprom::kSize> bytes);
 

@@ -15,13 +15,13 @@
 #include <map>
 #include <string>
 
-#include "platform/verdict.h"
 #include "util/owned.h"
+#include "verdict/verdict.h"
 
 namespace {
 
-using keymgr::tpm::PcrValue;
-using keymgr::tpm::Verdict;
+using keymgr::verdict::PcrValue;
+using keymgr::verdict::Verdict;
 
 int Fail(const std::string& what) {
   (void)std::fprintf(stderr, "keymgr-eventlog: %s\n", what.c_str());
@@ -29,7 +29,7 @@ int Fail(const std::string& what) {
 }
 
 std::string Hex(const PcrValue& value) {
-  return keymgr::tpm::DigestHex(value).data();
+  return keymgr::verdict::DigestHex(value).data();
 }
 
 // Field returns the text of |name|'s value in |line|: up to the next quote
@@ -93,14 +93,14 @@ int main(int argc, char** argv) {
     // The digest is the verdict's: content that says otherwise was edited.
     bool named = false;
     for (Verdict v : {Verdict::kOk, Verdict::kFail, Verdict::kNone}) {
-      named = named ||
-              (verdict == keymgr::tpm::VerdictName(v) && digest == keymgr::tpm::VerdictDigest(v));
+      named = named || (verdict == keymgr::verdict::VerdictName(v) &&
+                        digest == keymgr::verdict::VerdictDigest(v));
     }
     if (!named) {
       return Fail("line " + std::to_string(number) + ": the digest is not that of its verdict");
     }
     std::printf("%d pcr %u sha256:%s %s\n", number - 1, pcr, Hex(digest).c_str(), verdict.c_str());
-    pcrs[pcr] = keymgr::tpm::Extended(pcrs[pcr], digest);
+    pcrs[pcr] = keymgr::verdict::Extended(pcrs[pcr], digest);
   }
   for (const auto& [pcr, value] : pcrs) {
     std::printf("pcr %u replays to sha256:%s\n", pcr, Hex(value).c_str());

@@ -28,13 +28,17 @@ bool ParseInt(const char* text, int* value) {
 
 HostArgs ParseHostArgs(int argc, const char* const* argv) {
   HostArgs args;
-  if (argc == 2 && std::strcmp(argv[1], "dmsetup") == 0) {
-    args.action = HostArgs::Action::kDmsetup;
-    return args;
-  }
-  if (argc == 2 && std::strcmp(argv[1], "srk") == 0) {
-    args.action = HostArgs::Action::kSrk;
-    return args;
+  static constexpr struct {
+    const char* word;
+    HostArgs::Action action;
+  } kWords[] = {{"dmsetup", HostArgs::Action::kDmsetup},
+                {"srk", HostArgs::Action::kSrk},
+                {"keys", HostArgs::Action::kKeys}};
+  for (const auto& [word, action] : kWords) {
+    if (argc == 2 && std::strcmp(argv[1], word) == 0) {
+      args.action = action;
+      return args;
+    }
   }
   if (argc < 2 || argc > 3 || !ParseInt(argv[1], &args.option) ||
       (argc == 3 && !ParseInt(argv[2], &args.logFlag))) {

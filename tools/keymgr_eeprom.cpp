@@ -2,8 +2,11 @@
 // tests.
 //   keymgr-eeprom init                  a blank 32 KiB image (all 0xFF)
 //   keymgr-eeprom read OFFSET LENGTH    the bytes as upper-case hex
+//   keymgr-eeprom read REGION           a region of the map, by name
 //   keymgr-eeprom write OFFSET HEX      HEX is a string of hex digit pairs
-// OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal.
+//   keymgr-eeprom write REGION HEX      exactly the region's length
+// OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal; REGION is
+// store-key, sfe-conf, control or sc-digest.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -14,8 +17,8 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/eeprom.h"
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom.h"
+#include "eeprom/eeprom_map.h"
 #include "tools/eeprom_args.h"
 #include "util/owned.h"
 #include "util/paths.h"
@@ -32,8 +35,10 @@ int Fail(const char* what) {
 
 int Usage() {
   (void)std::fprintf(stderr,
-                     "usage: keymgr-eeprom init | read OFFSET LENGTH | write OFFSET HEX\n"
-                     "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal\n");
+                     "usage: keymgr-eeprom init | read OFFSET LENGTH | read REGION |\n"
+                     "       keymgr-eeprom write OFFSET HEX | write REGION HEX\n"
+                     "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal;\n"
+                     "  REGION is store-key, sfe-conf, control or sc-digest\n");
   return kErrorStatus;
 }
 

@@ -3,8 +3,13 @@
 //                                context came back, 1 when none did
 //   kmm-host dmsetup             CheckDmsetupDigest; exit 0 on a match
 //   kmm-host srk                 KmmPersistSrk; exit 0 when the SRK is persistent
+//   kmm-host keys                KmmListKeys: the handle of each key of this
+//                                system in the TPM, one a line, " named" after
+//                                the one keymgr.hddkeyid names; exit 1 when
+//                                the TPM cannot be searched
 #include <kmm/kmm.h>
 
+#include <cstdint>
 #include <cstdio>
 
 #include "tools/host_args.h"
@@ -14,9 +19,25 @@ namespace {
 constexpr int kUsageStatus = 2;
 
 int Usage() {
-  (void)std::fprintf(stderr,
-                     "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup | kmm-host srk\n");
+  (void)std::fprintf(
+      stderr,
+      "usage: kmm-host OPTION [LOG_FLAG] | kmm-host dmsetup | kmm-host srk | kmm-host keys\n");
   return kUsageStatus;
+}
+
+int ListKeys() {
+  // A TPM's persistent memory holds a few dozen objects at most.
+  std::uint32_t handles[64];
+  std::uint32_t named = 0;
+  const int count = KmmListKeys(handles, 64, &named);
+  if (count < 0 || count > 64) {
+    (void)std::fprintf(stderr, "kmm-host: the TPM's keys cannot be listed\n");
+    return 1;
+  }
+  for (int i = 0; i < count; ++i) {
+    std::printf("0x%08X%s\n", handles[i], handles[i] == named ? " named" : "");
+  }
+  return std::fflush(stdout) == 0 ? 0 : 1;
 }
 
 }  // namespace
@@ -31,6 +52,9 @@ int main(int argc, char** argv) {
   }
   if (args.action == Action::kSrk) {
     return KmmPersistSrk() == 0 ? 0 : 1;
+  }
+  if (args.action == Action::kKeys) {
+    return ListKeys();
   }
   if (args.action == Action::kUsage) {
     return Usage();

@@ -65,7 +65,7 @@ run "$work/cmake/consumer_static"
 
 # Only the module's C interface is exported.
 exported=$(nm -D --defined-only "$lib/libkmm.so" | awk '$2 == "T" { print $3 }' | sort | tr '\n' ' ')
-[ "$exported" = "CheckDmsetupDigest KeyManage KmmPersistSrk KmmSeedRandom " ] ||
+[ "$exported" = "CheckDmsetupDigest KeyManage KmmListKeys KmmPersistSrk KmmSeedRandom " ] ||
   fail "libkmm.so exports: $exported"
 
 # Man pages render without a warning.

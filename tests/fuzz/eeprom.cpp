@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/eeprom.h"
+#include "eeprom/eeprom.h"
 #include "support/files.h"
 #include "util/paths.h"
 

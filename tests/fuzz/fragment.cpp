@@ -10,8 +10,8 @@
 #include <span>
 #include <string>
 
-#include "platform/fragment.h"
 #include "support/files.h"
+#include "tpm/fragment.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   namespace tpm = keymgr::tpm;

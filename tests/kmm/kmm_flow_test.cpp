@@ -10,8 +10,8 @@
 #include <regex>
 #include <set>
 
+#include "eeprom/eeprom_map.h"
 #include "kmm/internal.h"
-#include "platform/eeprom_map.h"
 #include "support/fake_platform.h"
 #include "support/sandbox.h"
 #include "util/paths.h"

@@ -11,12 +11,12 @@
 #include <functional>
 
 #include "crypto/hash.h"
+#include "eeprom/eeprom_map.h"
 #include "keymgr_build_config.h"
 #include "kmm/internal.h"
-#include "platform/eeprom_map.h"
-#include "platform/pcp.h"
 #include "support/sandbox.h"
 #include "support/tpm_proxy.h"
+#include "tpm/pcp.h"
 #include "util/bytes.h"
 #include "util/paths.h"
 

@@ -5,8 +5,8 @@
 #include <cstring>
 
 #include "crypto/hash.h"
-#include "platform/eeprom.h"
-#include "platform/pcp.h"
+#include "eeprom/eeprom.h"
+#include "tpm/pcp.h"
 
 namespace keymgr::test {
 
@@ -106,6 +106,19 @@ int pcp_evict_stale_keys(const uint8_t* keep) {
   std::erase_if(KeyManager().keys,
                 [&](const auto& key) { return keep == nullptr || key.first != Digest(keep); });
   return 0;
+}
+int pcp_list_keys(uint32_t* handles, uint32_t capacity, uint32_t* count) {
+  *count = 0;
+  for (const auto& key : KeyManager().keys) {
+    if (*count < capacity) {
+      handles[*count] = static_cast<std::uint8_t>(key.first[0]);
+    }
+    ++*count;
+  }
+  return 0;
+}
+uint32_t pcp_key_handle(const char* nameHex) {
+  return static_cast<std::uint8_t>(Md5(nameHex)[0]);
 }
 int pcp_encryptDataFragment(const char* nameHex, const char*, const uint8_t* data, uint32_t length,
                             uint8_t* out, uint32_t* outSize) {

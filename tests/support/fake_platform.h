@@ -9,7 +9,7 @@
 #include <map>
 #include <string>
 
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom_map.h"
 
 namespace keymgr::test {
 

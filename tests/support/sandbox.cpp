@@ -12,8 +12,8 @@
 #include <fstream>
 #include <regex>
 
+#include "eeprom/eeprom_map.h"
 #include "keymgr_build_config.h"
-#include "platform/eeprom_map.h"
 
 namespace keymgr::test {
 

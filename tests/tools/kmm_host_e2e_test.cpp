@@ -16,8 +16,8 @@
 #include <thread>
 #include <utility>
 
+#include "eeprom/eeprom_map.h"
 #include "keymgr_build_config.h"
-#include "platform/eeprom_map.h"
 #include "support/sandbox.h"
 #include "util/paths.h"
 

@@ -9,10 +9,10 @@
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
-#include "platform/fragment.h"
-#include "platform/keys.h"
-#include "platform/verdict.h"
+#include "tpm/fragment.h"
+#include "tpm/keys.h"
 #include "util/secure.h"
+#include "verdict/verdict.h"
 
 namespace keymgr::tpm {
 
@@ -64,7 +64,7 @@ void PutBig32(crypto::Sha256& sha, uint32_t value) {
 // nothing that a regeneration or an update changes, so it marks the keys of
 // this system as well.
 TPM2B_DIGEST VerdictPolicy(int pcr) {
-  const std::array<uint8_t, 32> pcrDigest = crypto::Sha256Of(GoodPcrValue());
+  const std::array<uint8_t, 32> pcrDigest = crypto::Sha256Of(verdict::GoodPcrValue());
   std::array<uint8_t, sizeof(TPML_PCR_SELECTION)> selection{};
   std::size_t size = 0;
   const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);
@@ -237,8 +237,12 @@ Status DeleteKey(Connection& tpm, const uint8_t* nameDigest) {
   return EvictPersistent(tpm, handle);
 }
 
-Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
-  const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
+namespace {
+
+// ForEachOwnKey calls |each| with the handle of every persistent key of this
+// key manager.
+template <class Each>
+Status ForEachOwnKey(Connection& tpm, Each each) {
   TPMI_YES_NO more = TPM2_NO;
   Output<TPMS_CAPABILITY_DATA> data;
   if (Status status = Run(
@@ -253,19 +257,41 @@ Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
   }
   // A TPM holds a handful of persistent objects, far fewer than one answer
   // can list, so |more| is not followed.
-  Status result;
   const TPML_HANDLE& handles = data.get()->data.handles;
   for (uint32_t i = 0; i < handles.count; ++i) {
     const uint32_t handle = handles.handle[i];
     TPM2B_PUBLIC area{};
-    if (handle > kOwnerPersistentLast || handle == keep || !ReadOwnKey(tpm, handle, &area).ok()) {
-      continue;
+    if (handle <= kOwnerPersistentLast && ReadOwnKey(tpm, handle, &area).ok()) {
+      each(handle);
+    }
+  }
+  return Status();
+}
+
+}  // namespace
+
+Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
+  const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
+  Status result;
+  Status listed = ForEachOwnKey(tpm, [&](uint32_t handle) {
+    if (handle == keep) {
+      return;
     }
     if (Status status = EvictPersistent(tpm, handle); !status.ok()) {
       result = status;
     }
-  }
-  return result;
+  });
+  return listed.ok() ? result : listed;
+}
+
+Status ListOwnKeys(Connection& tpm, std::span<uint32_t> handles, uint32_t* count) {
+  *count = 0;
+  return ForEachOwnKey(tpm, [&](uint32_t handle) {
+    if (*count < handles.size()) {
+      handles[*count] = handle;
+    }
+    ++*count;
+  });
 }
 
 }  // namespace keymgr::tpm

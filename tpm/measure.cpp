@@ -3,8 +3,8 @@
 // this.
 #include <cstring>
 
-#include "platform/pcp.h"
-#include "platform/tpm.h"
+#include "tpm/connection.h"
+#include "tpm/pcp.h"
 
 using namespace keymgr::tpm;
 

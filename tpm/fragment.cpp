@@ -1,4 +1,4 @@
-#include "platform/fragment.h"
+#include "tpm/fragment.h"
 
 #include <algorithm>
 #include <cstring>

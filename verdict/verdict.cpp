@@ -1,10 +1,10 @@
-#include "platform/verdict.h"
+#include "verdict/verdict.h"
 
 #include <cstring>
 
 #include "crypto/hash.h"
 
-namespace keymgr::tpm {
+namespace keymgr::verdict {
 
 const char* VerdictName(Verdict verdict) {
   return verdict == Verdict::kOk ? "BN=OK" : verdict == Verdict::kFail ? "BN=FAIL" : "none";
@@ -43,4 +43,4 @@ std::array<char, 65> DigestHex(const PcrValue& digest) {
   return text;
 }
 
-}  // namespace keymgr::tpm
+}  // namespace keymgr::verdict

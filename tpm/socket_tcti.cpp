@@ -1,4 +1,4 @@
-#include "platform/socket_tcti.h"
+#include "tpm/socket_tcti.h"
 
 #include <netdb.h>
 #include <poll.h>

@@ -37,6 +37,20 @@ inline constexpr std::uint8_t kControlEnableBit = 0x40;
 inline constexpr std::uint32_t kScDigestOffset = 32256;
 inline constexpr std::uint32_t kScDigestLength = 32;
 
+// Region is one region of the map by name, for tools and tests that read
+// or write it.
+struct Region {
+  const char* name;
+  std::uint32_t offset;
+  std::uint32_t length;
+};
+inline constexpr Region kRegions[] = {
+    {"store-key", kStoreKeyOffset, kStoreKeyLength},
+    {"sfe-conf", kSfeConfOffset, kSfeConfLength},
+    {"control", kControlByteOffset, 1},
+    {"sc-digest", kScDigestOffset, kScDigestLength},
+};
+
 static_assert(kStoreKeyOffset >= kSectionStart &&
               kStoreKeyOffset + kStoreKeyLength <= kSectionStart + kSectionLength);
 static_assert(kScDigestOffset + kScDigestLength <= kSize);

@@ -1,4 +1,4 @@
-#include "platform/eeprom.h"
+#include "eeprom/eeprom.h"
 
 #include <fcntl.h>
 #include <openssl/crypto.h>
@@ -12,7 +12,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/eeprom_map.h"
+#include "eeprom/eeprom_map.h"
 #include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"

@@ -6,8 +6,8 @@
 
 #include "crypto/hash.h"
 #include "crypto/rsa.h"
-#include "platform/fragment.h"
-#include "platform/keys.h"
+#include "tpm/fragment.h"
+#include "tpm/keys.h"
 #include "util/secure.h"
 
 namespace keymgr::tpm {

@@ -2,7 +2,7 @@
 #include <algorithm>
 #include <cstring>
 
-#include "platform/keys.h"
+#include "tpm/keys.h"
 
 namespace keymgr::tpm {
 

@@ -1,6 +1,6 @@
 // The TPM connection: opening it, sending each command within the deadline,
 // and recovering from a TPM that was not started or is full.
-#include "platform/tpm.h"
+#include "tpm/connection.h"
 
 #include <pthread.h>
 #include <time.h>
@@ -16,7 +16,7 @@
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
-#include "platform/socket_tcti.h"
+#include "tpm/socket_tcti.h"
 #include "util/random.h"
 
 namespace keymgr::tpm {

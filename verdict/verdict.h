@@ -7,7 +7,7 @@
 #include <array>
 #include <cstdint>
 
-namespace keymgr::tpm {
+namespace keymgr::verdict {
 
 enum class Verdict { kOk, kFail, kNone };
 
@@ -32,4 +32,4 @@ const char* VerdictName(Verdict verdict);
 // event log writes digests.
 std::array<char, 65> DigestHex(const PcrValue& digest);
 
-}  // namespace keymgr::tpm
+}  // namespace keymgr::verdict

@@ -7,8 +7,9 @@
 #pragma once
 
 #include <cstdint>
+#include <span>
 
-#include "platform/tpm.h"
+#include "tpm/connection.h"
 
 namespace keymgr::tpm {
 
@@ -36,6 +37,9 @@ Status DeleteKey(Connection& tpm, const std::uint8_t* nameDigest);
 // EvictStaleKeys evicts every key of this key manager but the one of
 // |keepNameDigest| (may be null).
 Status EvictStaleKeys(Connection& tpm, const std::uint8_t* keepNameDigest);
+// ListOwnKeys writes the handles of the keys of this key manager in the TPM
+// to |handles|, as many as fit, and sets |*count| to how many there are.
+Status ListOwnKeys(Connection& tpm, std::span<std::uint32_t> handles, std::uint32_t* count);
 
 // The keys a sealed build creates (KEYMGR_SEAL_TO_VERDICT) require PCR
 // SealPcr() at the good boot verdict's value as well as their password; -1

@@ -56,6 +56,15 @@ PCP_NODISCARD int pcp_delete_key(const uint8_t* nameDigest, uint32_t flags);
 // or non-zero when the TPM could not be searched or a key not evicted.
 PCP_NODISCARD int pcp_evict_stale_keys(const uint8_t* keepNameDigest);
 
+// pcp_list_keys writes the persistent handles of the keys this key manager
+// created to |handles|, at most |capacity| of them, and sets |*count| to how
+// many the TPM holds (which may be more). For a device's own checks.
+PCP_NODISCARD int pcp_list_keys(uint32_t* handles, uint32_t capacity, uint32_t* count);
+
+// pcp_key_handle is the persistent handle of the key whose name digest is
+// the MD5 of |nameHex|. It sends nothing to the TPM.
+uint32_t pcp_key_handle(const char* nameHex);
+
 // pcp_encryptDataFragment seals |length| bytes of |data| under the key whose
 // name digest is the MD5 of |nameHex|: on the host, with the key's public
 // area as the TPM gives it. |*outSize| is the capacity of |out| on entry and

@@ -2,8 +2,8 @@
 // share while a caller holds it.
 #include <optional>
 
-#include "platform/keys.h"
-#include "platform/pcp.h"
+#include "tpm/keys.h"
+#include "tpm/pcp.h"
 #include "util/random.h"
 #include "util/secure.h"
 
@@ -105,6 +105,19 @@ int pcp_delete_key(const uint8_t* nameDigest, uint32_t /*flags*/) {
 
 int pcp_evict_stale_keys(const uint8_t* keepNameDigest) {
   return OnTpm([&](Connection& tpm) { return EvictStaleKeys(tpm, keepNameDigest); });
+}
+
+int pcp_list_keys(uint32_t* handles, uint32_t capacity, uint32_t* count) {
+  if ((handles == nullptr && capacity != 0) || count == nullptr) {
+    return 1;
+  }
+  return OnTpm([&](Connection& tpm) {
+    return ListOwnKeys(tpm, std::span<uint32_t>(handles, capacity), count);
+  });
+}
+
+uint32_t pcp_key_handle(const char* nameHex) {
+  return nameHex != nullptr ? HandleOfName(nameHex) : 0;
 }
 
 int pcp_encryptDataFragment(const char* nameHex, const char* /*passHex*/, const uint8_t* data,

@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "crypto/hash.h"
-#include "platform/tpm.h"
+#include "tpm/connection.h"
 #include "util/random.h"
 
 namespace keymgr::tpm {

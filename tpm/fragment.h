@@ -10,7 +10,7 @@
 #include <cstdint>
 #include <span>
 
-#include "platform/pcp.h"
+#include "tpm/pcp.h"
 #include "util/status.h"
 
 namespace keymgr::tpm {
