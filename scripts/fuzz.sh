@@ -10,12 +10,14 @@
 # longer than 10 s leaves the input in build-fuzz/ and fails the script.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-bash scripts/install-deps.sh
+echo "== installing what the fuzzers need =="
+bash scripts/install-deps.sh fuzz
 
 seconds=${1:-30}
 build="build-fuzz"
 root=${KEYMGR_FUZZ_ROOT:-/dev/shm/keymgr-fuzz}
 
+echo "== building the harnesses in $build/ =="
 cmake -S . -B "$build" -G Ninja -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ \
   -DKEYMGR_FUZZ=ON -DBUILD_TESTING=OFF -DKEYMGR_ROOT="$root"
 cmake --build "$build" -j "$(nproc)"

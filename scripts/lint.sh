@@ -5,9 +5,11 @@
 # any finding.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-bash scripts/install-deps.sh
+echo "== installing what the checks need =="
+bash scripts/install-deps.sh lint
 
 build="build-lint"
+echo "== configuring $build/ =="
 # A signed, measured and sealed build (the test key), so that the code of
 # every opt-in build is analysed too.
 cmake -S . -B "$build" -G Ninja -DBUILD_TESTING=OFF -DCMAKE_EXPORT_COMPILE_COMMANDS=ON \

@@ -24,14 +24,17 @@ if [ "${1:-}" = --target ]; then
   extra=("${cross_args[@]}")
   shift 2
 else
-  bash scripts/install-deps.sh
+  echo "== installing what packaging needs =="
+  bash scripts/install-deps.sh package
 fi
 for arg; do [[ $arg == -D* ]] || usage; done
 
+echo "== building the device build in $build/ =="
 cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=MinSizeRel -DBUILD_TESTING=OFF -DKEYMGR_ROOT= \
   -DKEYMGR_REDACT_OOK=ON \
   -DCMAKE_INSTALL_PREFIX=/usr -DKEYMGR_INITDIR=/etc/init.d "${extra[@]}" "$@" >/dev/null
 cmake --build "$build" -j "$(nproc)"
+echo "== installing into $build/install and making the package =="
 rm -rf "$build/install" "$build"/keymgr_*.deb
 DESTDIR=$PWD/$build/install cmake --install "$build" --strip >/dev/null
 (cd "$build" && cpack -G DEB >/dev/null)

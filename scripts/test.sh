@@ -67,6 +67,8 @@ case "${1:-}" in
   --target)
     build=build-${2:-}
     root=${KEYMGR_TEST_ROOT:-/tmp/keymgr-test-${2:-}}
+    # cross-setup.sh installs what every job needs, with the cross compiler.
+    echo "== installing what the tests need, the ${2:-} cross compiler and the target's libraries =="
     # shellcheck source=scripts/cross-setup.sh
     . scripts/cross-setup.sh "${2:-}" "$build"
     extra=("${cross_args[@]}")
@@ -75,15 +77,24 @@ case "${1:-}" in
   --vm) exec bash scripts/vm-test.sh ;;
   *) usage ;;
 esac
-# A cross build has installed what it needs along with its cross compiler.
-[ -n "${cross_args:-}" ] || bash scripts/install-deps.sh
+if [ -z "${cross_args:-}" ]; then
+  echo "== installing what the tests need =="
+  bash scripts/install-deps.sh test
+fi
 
 # The suite installs tests/kmm/data/dmsetup as the disk-mapper tool, so the
 # build expects that file's digest.
 dmsetup_sha256=$(sha256sum tests/kmm/data/dmsetup | cut -d" " -f1)
 
+echo "== configuring $build/ (sandbox root $root) =="
 cmake -S . -B "$build" -G Ninja -DKEYMGR_ROOT="$root" -DKEYMGR_DMSETUP_SHA256="$dmsetup_sha256" \
   "${extra[@]}"
+echo "== building =="
 cmake --build "$build" -j "$(nproc)"
 cd "$build"
+echo "== running $(ctest -N | sed -n 's/^Total Tests: //p') tests =="
+if grep -q '^KEYMGR_HARDENING_CHECK:FILEPATH=.*NOTFOUND' CMakeCache.txt; then
+  echo "   (hardening_check is skipped: hardening-check, from devscripts, is not installed;" \
+    "bash scripts/install-deps.sh test devscripts adds it)"
+fi
 ctest --output-on-failure -j "$(nproc)"
