@@ -207,16 +207,102 @@ Status GetRandom(Connection& tpm, ESYS_TR session, std::uint16_t count,
   return status;
 }
 
-Status PcrExtend(Connection& tpm, std::uint32_t pcr, const TPML_DIGEST_VALUES& digests) {
-  // A PCR of 0-15 needs the platform's empty auth, given as a password.
+Status PcrExtend(Connection& tpm, std::uint32_t pcr, ESYS_TR session,
+                 const TPML_DIGEST_VALUES& digests) {
   const ESYS_TR handle = ESYS_TR_PCR0 + pcr;
   return Exchange(
       tpm, "Esys_PCR_Extend", Retry::kRecover,
       [&] {
-        return Esys_PCR_Extend_Async(tpm.ctx(), handle, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                                     ESYS_TR_NONE, &digests);
+        return Esys_PCR_Extend_Async(tpm.ctx(), handle, session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                     &digests);
       },
       [&] { return Esys_PCR_Extend_Finish(tpm.ctx()); });
+}
+
+Status LoadExternal(Connection& tpm, const TPM2B_PUBLIC& area, ESYS_TR* key) {
+  return Exchange(
+      tpm, "Esys_LoadExternal", Retry::kRecover,
+      [&] {
+        return Esys_LoadExternal_Async(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE, nullptr,
+                                       &area, ESYS_TR_RH_OWNER);
+      },
+      [&] { return Esys_LoadExternal_Finish(tpm.ctx(), key); });
+}
+
+Status VerifySignature(Connection& tpm, ESYS_TR key, const TPM2B_DIGEST& digest,
+                       const TPMT_SIGNATURE& signature, Output<TPMT_TK_VERIFIED>* ticket) {
+  return Exchange(
+      tpm, "Esys_VerifySignature", Retry::kRecover,
+      [&] {
+        return Esys_VerifySignature_Async(tpm.ctx(), key, ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
+                                          &digest, &signature);
+      },
+      [&] { return Esys_VerifySignature_Finish(tpm.ctx(), ticket->out()); });
+}
+
+Status PolicyAuthorize(Connection& tpm, ESYS_TR session, const TPM2B_DIGEST& approved,
+                       const TPM2B_NONCE& policyRef, const TPM2B_NAME& signer,
+                       const TPMT_TK_VERIFIED& ticket) {
+  return Exchange(
+      tpm, "Esys_PolicyAuthorize", Retry::kRecover,
+      [&] {
+        return Esys_PolicyAuthorize_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                          ESYS_TR_NONE, &approved, &policyRef, &signer, &ticket);
+      },
+      [&] { return Esys_PolicyAuthorize_Finish(tpm.ctx()); });
+}
+
+Status PolicyNV(Connection& tpm, ESYS_TR session, ESYS_TR index, const TPM2B_OPERAND& operand,
+                TPM2_EO operation) {
+  return Exchange(
+      tpm, "Esys_PolicyNV", Retry::kRecover,
+      [&] {
+        return Esys_PolicyNV_Async(tpm.ctx(), index, index, session, ESYS_TR_PASSWORD, ESYS_TR_NONE,
+                                   ESYS_TR_NONE, &operand, 0, operation);
+      },
+      [&] { return Esys_PolicyNV_Finish(tpm.ctx()); });
+}
+
+Status PolicyCommandCode(Connection& tpm, ESYS_TR session, TPM2_CC code) {
+  return Exchange(
+      tpm, "Esys_PolicyCommandCode", Retry::kRecover,
+      [&] {
+        return Esys_PolicyCommandCode_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                            ESYS_TR_NONE, code);
+      },
+      [&] { return Esys_PolicyCommandCode_Finish(tpm.ctx()); });
+}
+
+Status NvDefineSpace(Connection& tpm, const TPM2B_NV_PUBLIC& area, ESYS_TR* index) {
+  const TPM2B_AUTH auth{};
+  return Exchange(
+      tpm, "Esys_NV_DefineSpace", Retry::kRecover,
+      [&] {
+        return Esys_NV_DefineSpace_Async(tpm.ctx(), ESYS_TR_RH_OWNER, ESYS_TR_PASSWORD,
+                                         ESYS_TR_NONE, ESYS_TR_NONE, &auth, &area);
+      },
+      [&] { return Esys_NV_DefineSpace_Finish(tpm.ctx(), index); });
+}
+
+Status NvRead(Connection& tpm, ESYS_TR index, ESYS_TR session, std::uint16_t size,
+              Output<TPM2B_MAX_NV_BUFFER>* data) {
+  return Exchange(
+      tpm, "Esys_NV_Read", Retry::kRecover,
+      [&] {
+        return Esys_NV_Read_Async(tpm.ctx(), index, index, session, ESYS_TR_NONE, ESYS_TR_NONE,
+                                  size, 0);
+      },
+      [&] { return Esys_NV_Read_Finish(tpm.ctx(), data->out()); });
+}
+
+Status NvIncrement(Connection& tpm, ESYS_TR index, ESYS_TR session) {
+  return Exchange(
+      tpm, "Esys_NV_Increment", Retry::kRecover,
+      [&] {
+        return Esys_NV_Increment_Async(tpm.ctx(), index, index, session, ESYS_TR_NONE,
+                                       ESYS_TR_NONE);
+      },
+      [&] { return Esys_NV_Increment_Finish(tpm.ctx()); });
 }
 
 }  // namespace keymgr::tpm

@@ -66,8 +66,46 @@ Status RsaDecrypt(Connection& tpm, ESYS_TR key, ESYS_TR session, const TPM2B_PUB
 Status GetRandom(Connection& tpm, ESYS_TR session, std::uint16_t count,
                  SecretOutput<TPM2B_DIGEST>* random);
 
-// PcrExtend extends PCR |pcr| with |digests|, with the platform's empty
-// password.
-Status PcrExtend(Connection& tpm, std::uint32_t pcr, const TPML_DIGEST_VALUES& digests);
+// PcrExtend extends PCR |pcr| with |digests|, authorised with the
+// platform's empty password in |session|: a salted HMAC session, so that a
+// command changed on its way is refused.
+Status PcrExtend(Connection& tpm, std::uint32_t pcr, ESYS_TR session,
+                 const TPML_DIGEST_VALUES& digests);
+
+// LoadExternal loads the public key |area| into the owner hierarchy, so
+// that the tickets of its signatures serve a policy.
+Status LoadExternal(Connection& tpm, const TPM2B_PUBLIC& area, ESYS_TR* key);
+
+// VerifySignature checks |signature| of |digest| under |key| and gives the
+// TPM's ticket for it.
+Status VerifySignature(Connection& tpm, ESYS_TR key, const TPM2B_DIGEST& digest,
+                       const TPMT_SIGNATURE& signature, Output<TPMT_TK_VERIFIED>* ticket);
+
+// PolicyAuthorize replaces the digest of |session|, which must equal
+// |approved|, by the one that |signer|'s approval of it for |policyRef|
+// stands for, proved by |ticket|.
+Status PolicyAuthorize(Connection& tpm, ESYS_TR session, const TPM2B_DIGEST& approved,
+                       const TPM2B_NONCE& policyRef, const TPM2B_NAME& signer,
+                       const TPMT_TK_VERIFIED& ticket);
+
+// PolicyNV compares the NV index's data from its start with |operand| by
+// |operation|, reading it with the index's empty password.
+Status PolicyNV(Connection& tpm, ESYS_TR session, ESYS_TR index, const TPM2B_OPERAND& operand,
+                TPM2_EO operation);
+
+// PolicyCommandCode limits |session| to the command |code|.
+Status PolicyCommandCode(Connection& tpm, ESYS_TR session, TPM2_CC code);
+
+// NvDefineSpace defines the NV index of |area| with an empty password, with
+// the owner's empty password.
+Status NvDefineSpace(Connection& tpm, const TPM2B_NV_PUBLIC& area, ESYS_TR* index);
+
+// NvRead reads |size| bytes of |index| from its start with the index's
+// empty password, authorised in |session|.
+Status NvRead(Connection& tpm, ESYS_TR index, ESYS_TR session, std::uint16_t size,
+              Output<TPM2B_MAX_NV_BUFFER>* data);
+
+// NvIncrement adds one to the counter |index|, authorised in |session|.
+Status NvIncrement(Connection& tpm, ESYS_TR index, ESYS_TR session);
 
 }  // namespace keymgr::tpm

@@ -21,5 +21,5 @@ int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest) {
   values.count = 1;
   values.digests[0].hashAlg = TPM2_ALG_SHA256;
   std::memcpy(values.digests[0].digest.sha256, digest, TPM2_SHA256_DIGEST_SIZE);
-  return PcrExtend(tpm, pcr, values).ok() ? 0 : 1;
+  return PcrExtend(tpm, pcr, ESYS_TR_PASSWORD, values).ok() ? 0 : 1;
 }
