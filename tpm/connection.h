@@ -1,6 +1,6 @@
-// The TPM connection of the platform key manager over tpm2-tss: the handles
-// it owns, the deadline of every command, the storage primary and the
-// sessions. Private to platform/.
+// The TPM connection of the platform key manager over tpm2-tss: its
+// options, the handles it owns, and the exchange of one command within its
+// deadline. The commands themselves are in tpm/commands.h. Private to tpm/.
 #pragma once
 
 #include <openssl/crypto.h>
@@ -9,7 +9,6 @@
 #include <tss2/tss2_sys.h>
 #include <tss2/tss2_tctildr.h>
 
-#include <chrono>
 #include <cstdint>
 
 #include "util/owned.h"
@@ -17,9 +16,22 @@
 
 namespace keymgr::tpm {
 
-// The persistent handle of the storage root key in TCG's provisioning
-// guidance; systemd and tpm2-tss FAPI use it too.
-inline constexpr std::uint32_t kSrkHandle = 0x81000001u;
+// Options are what a connection is opened with.
+struct Options {
+  // The tpm2-tss TCTI configuration; "swtpm:" takes this key manager's own
+  // socket transport.
+  const char* transport = nullptr;
+  // The deadline of every command, in milliseconds.
+  int deadlineMs = 0;
+  // The PCR of the SHA-256 bank that the keys this connection creates and
+  // opens require at the good boot verdict's value, or -1 for plain keys.
+  int sealPcr = -1;
+};
+
+// BuildOptions are the build's: KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS and
+// KEYMGR_SEAL_PCR. Defined alone in options.cpp, so that a test program can
+// link its own in their place.
+Options BuildOptions();
 
 // TssFailure names a failed tpm2-tss call once, with the decoded code, on
 // request (KEYMGR_DEBUG).
@@ -89,11 +101,7 @@ class SigpipeBlock {
 // Its members go in reverse order: the session and the parent are flushed or
 // closed before ESAPI and then the transport are finalised.
 struct Connection {
-  // The TCTI configuration and the deadline of each command, in
-  // milliseconds: the build's (KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS) unless a
-  // test set others.
-  const char* transport = nullptr;
-  int deadlineMs = 0;
+  Options options;
   TctiContext tcti;
   EsysContext esys;
   TSS2_SYS_CONTEXT* sys = nullptr;  // ESAPI's own, for the raw commands
@@ -119,29 +127,35 @@ struct Connection {
 // connection and flushes what it leaves behind.
 bool HasResourceManager(const char* tcti);
 
-// SetTransport makes the connections opened from now on use |tcti| and a
-// command deadline of |deadlineMs|; a null |tcti| restores the build's.
-void SetTransport(const char* tcti, int deadlineMs);
+// Connect opens the transport of |options| and ESAPI on it. It sends
+// nothing: a TPM that still needs TPM2_Startup gets it with the first
+// command.
+Status Connect(Connection& tpm, const Options& options);
 
-// Connect opens the transport and ESAPI on it. It sends nothing: a TPM that
-// still needs TPM2_Startup gets it with the first command.
-Status Connect(Connection& tpm);
+// How a command that the TPM refuses for a state it can leave is handled.
+enum class Retry {
+  // A TPM that was not started is started, and without a resource manager a
+  // TPM whose slots are full of what a dead process left is cleared; then
+  // the command is sent again.
+  kRecover,
+  // Sent once: the commands of the recovery itself, which must not recover
+  // in turn.
+  kOnce,
+};
 
-// Run sends one command and names its failure |call|. |send| starts the
-// command (an ESAPI _Async call, or a raw command's preparation and send) and
-// |finish| collects the answer, waiting at most tpm.waitMs; the command fails
-// at the connection's deadline. A TPM that was not started is started and the command
-// sent again; without a resource manager, a TPM whose slots are full of what
-// a dead process left is cleared and the command sent again.
+// Exchange sends one command and names its failure |call|. |send| starts the
+// command (an ESAPI _Async call, or a raw command's preparation and send)
+// and |finish| collects the answer, waiting at most tpm.waitMs; the command
+// fails at the connection's deadline. Only tpm/commands.cpp calls it.
 template <class Send, class Finish>
-Status Run(Connection& tpm, const char* call, Send send, Finish finish);
+Status Exchange(Connection& tpm, const char* call, Retry retry, Send send, Finish finish);
 
-// SendOnce and Recover are Run's parts, out of line.
+// SendOnce and Recover are Exchange's parts, out of line.
 TSS2_RC SendOnce(Connection& tpm, TSS2_RC (*send)(void*), TSS2_RC (*finish)(void*), void* call);
 bool Recover(Connection& tpm, TSS2_RC rc);
 
 template <class Send, class Finish>
-Status Run(Connection& tpm, const char* call, Send send, Finish finish) {
+Status Exchange(Connection& tpm, const char* call, Retry retry, Send send, Finish finish) {
   struct Pair {
     Send& send;
     Finish& finish;
@@ -151,7 +165,7 @@ Status Run(Connection& tpm, const char* call, Send send, Finish finish) {
     rc = SendOnce(
         tpm, [](void* p) -> TSS2_RC { return static_cast<Pair*>(p)->send(); },
         [](void* p) -> TSS2_RC { return static_cast<Pair*>(p)->finish(); }, &pair);
-    if (!Recover(tpm, rc)) {
+    if (retry == Retry::kOnce || !Recover(tpm, rc)) {
       break;
     }
   }
@@ -161,13 +175,6 @@ Status Run(Connection& tpm, const char* call, Send send, Finish finish) {
 // WipeResponse wipes the parameters of the last response in ESAPI's own
 // buffer, where a response that a session encrypted lies decrypted.
 void WipeResponse(Connection& tpm);
-
-// ReadPublic reads the public area of the object at |handle| and checks it
-// against the name the TPM gives for it.
-Status ReadPublic(Connection& tpm, TPM2_HANDLE handle, TPM2B_PUBLIC* area);
-
-// EvictPersistent evicts the persistent object at |handle| (owner auth).
-Status EvictPersistent(Connection& tpm, TPM2_HANDLE handle);
 
 // UseParent makes the storage parent of the keys available, once per
 // connection: the persistent SRK when it is there with the standard storage
@@ -192,5 +199,9 @@ Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes);
 // PersistSrk makes the standard SRK persistent at kSrkHandle, or finds it
 // there already.
 Status PersistSrk(Connection& tpm);
+
+// The persistent handle of the storage root key in TCG's provisioning
+// guidance; systemd and tpm2-tss FAPI use it too.
+inline constexpr std::uint32_t kSrkHandle = 0x81000001u;
 
 }  // namespace keymgr::tpm

@@ -2,6 +2,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "tpm/commands.h"
 #include "tpm/keys.h"
 
 namespace keymgr::tpm {
@@ -10,18 +11,6 @@ namespace {
 
 // TPM2_GetRandom gives at most the size of the TPM's largest digest.
 constexpr uint32_t kMaxEntropy = sizeof(TPMU_HA);
-
-// GetRandom draws up to |want| bytes in one command, in |session| (the
-// response encrypted) or with none.
-Status GetRandom(Connection& tpm, ESYS_TR session, uint16_t want,
-                 SecretOutput<TPM2B_DIGEST>& part) {
-  Status status = Run(
-      tpm, "Esys_GetRandom",
-      [&] { return Esys_GetRandom_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE, want); },
-      [&] { return Esys_GetRandom_Finish(tpm.ctx(), part.out()); });
-  WipeResponse(tpm);
-  return status;
-}
 
 }  // namespace
 
@@ -34,7 +23,7 @@ Status DrawRandom(Connection& tpm, uint32_t count, uint8_t* dst) {
   while (filled < count) {
     const auto want = static_cast<uint16_t>(std::min(count - filled, kMaxEntropy));
     SecretOutput<TPM2B_DIGEST> part;
-    if (Status status = GetRandom(tpm, tpm.session.get().tr, want, part); !status.ok()) {
+    if (Status status = GetRandom(tpm, tpm.session.get().tr, want, &part); !status.ok()) {
       return status;
     }
     const uint32_t take = std::min<uint32_t>({part.get()->size, want, sizeof(part.get()->buffer)});
@@ -53,7 +42,7 @@ Status DrawEntropy(Connection& tpm, uint32_t count, uint8_t* dst, uint32_t* draw
   }
   SecretOutput<TPM2B_DIGEST> part;
   const auto want = static_cast<uint16_t>(std::min(count, kMaxEntropy));
-  if (Status status = GetRandom(tpm, ESYS_TR_NONE, want, part); !status.ok()) {
+  if (Status status = GetRandom(tpm, ESYS_TR_NONE, want, &part); !status.ok()) {
     return status;
   }
   *drawn = std::min<uint32_t>({part.get()->size, want, sizeof(part.get()->buffer)});

@@ -9,6 +9,7 @@
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
+#include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
 #include "util/secure.h"
@@ -49,8 +50,6 @@ uint32_t PersistentHandle(const uint8_t* nameDigest) {
 
 // A sealed key's user role is reached only through its policy.
 constexpr TPMA_OBJECT kSealedKeyAttributes = kKeyAttributes & ~TPMA_OBJECT_USERWITHAUTH;
-
-int g_sealPcr = KEYMGR_SEAL_PCR;
 
 void PutBig32(crypto::Sha256& sha, uint32_t value) {
   const uint8_t bytes[4] = {static_cast<uint8_t>(value >> 24), static_cast<uint8_t>(value >> 16),
@@ -105,14 +104,6 @@ bool IsOwnKey(const TPMT_PUBLIC& area) {
 
 }  // namespace
 
-int SealPcr() {
-  return g_sealPcr;
-}
-
-void SetSealPcr(int pcr) {
-  g_sealPcr = pcr >= 0 && pcr < 24 ? pcr : -1;
-}
-
 TPML_PCR_SELECTION PcrSelection(int pcr) {
   TPML_PCR_SELECTION pcrs{};
   pcrs.count = 1;
@@ -145,13 +136,13 @@ Status ReadOwnKey(Connection& tpm, uint32_t handle, TPM2B_PUBLIC* area) {
 }
 
 // KeyTemplate is the template of every key this key manager creates.
-TPM2B_TEMPLATE KeyTemplate(uint32_t bits) {
+TPM2B_TEMPLATE KeyTemplate(uint32_t bits, int sealPcr) {
   TPMT_PUBLIC area{};
   area.type = TPM2_ALG_RSA;
   area.nameAlg = TPM2_ALG_SHA256;
-  area.objectAttributes = g_sealPcr >= 0 ? kSealedKeyAttributes : kKeyAttributes;
-  if (g_sealPcr >= 0) {
-    area.authPolicy = VerdictPolicy(g_sealPcr);
+  area.objectAttributes = sealPcr >= 0 ? kSealedKeyAttributes : kKeyAttributes;
+  if (sealPcr >= 0) {
+    area.authPolicy = VerdictPolicy(sealPcr);
   } else {
     area.authPolicy.size = sizeof(kKeyMarker);
     std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
@@ -188,35 +179,27 @@ Status CreateKey(Connection& tpm, const uint8_t* nameDigest, const uint8_t* pass
   ScopeExit wipeSensitive([&] { OPENSSL_cleanse(&sensitive, sizeof(sensitive)); });
   sensitive.sensitive.userAuth.size = kDigestSize;
   std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, kDigestSize);
-  const TPM2B_TEMPLATE templ = KeyTemplate(bits);
+  const TPM2B_TEMPLATE templ = KeyTemplate(bits, tpm.options.sealPcr);
 
   ESYS_TR loaded = ESYS_TR_NONE;
   Output<TPM2B_PUBLIC> keyPublic;
-  if (Status status = Run(
-          tpm, "Esys_CreateLoaded",
-          [&] {
-            return Esys_CreateLoaded_Async(tpm.ctx(), tpm.Parent(), tpm.session.get().tr,
-                                           ESYS_TR_NONE, ESYS_TR_NONE, &sensitive, &templ);
-          },
-          [&] { return Esys_CreateLoaded_Finish(tpm.ctx(), &loaded, nullptr, keyPublic.out()); });
+  if (Status status = CreateLoaded(tpm, tpm.Parent(), tpm.session.get().tr, sensitive, templ,
+                                   &loaded, &keyPublic);
       !status.ok()) {
     return status;
   }
   TransientObject loadedKey(tpm.Object(loaded));
   // The handle is checked by the TPM itself: the eviction fails when it is
   // taken.
-  ESYS_TR persistent = ESYS_TR_NONE;
-  if (Status status = Run(
-          tpm, "Esys_EvictControl",
-          [&] {
-            return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, loaded, ESYS_TR_PASSWORD,
-                                           ESYS_TR_NONE, ESYS_TR_NONE, handle);
-          },
-          [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
+  TPM2_HANDLE loadedHandle = 0;
+  if (Status status =
+          Check("Esys_TR_GetTpmHandle", Esys_TR_GetTpmHandle(tpm.ctx(), loaded, &loadedHandle));
       !status.ok()) {
     return status;
   }
-  PersistentObject key(tpm.Object(persistent));
+  if (Status status = EvictControl(tpm, loadedHandle, handle); !status.ok()) {
+    return status;
+  }
   // The public area came from the TPM with the key: sealing to it in the same
   // connection needs no command.
   tpm.createdHandle = handle;
@@ -234,7 +217,7 @@ Status DeleteKey(Connection& tpm, const uint8_t* nameDigest) {
   if (Status status = ReadOwnKey(tpm, handle, &area); !status.ok()) {
     return status;
   }
-  return EvictPersistent(tpm, handle);
+  return EvictControl(tpm, handle, handle);
 }
 
 namespace {
@@ -243,21 +226,15 @@ namespace {
 // key manager.
 template <class Each>
 Status ForEachOwnKey(Connection& tpm, Each each) {
-  TPMI_YES_NO more = TPM2_NO;
-  Output<TPMS_CAPABILITY_DATA> data;
-  if (Status status = Run(
-          tpm, "Esys_GetCapability",
-          [&] {
-            return Esys_GetCapability_Async(tpm.ctx(), ESYS_TR_NONE, ESYS_TR_NONE, ESYS_TR_NONE,
-                                            TPM2_CAP_HANDLES, kOwnKeysFirst, TPM2_MAX_CAP_HANDLES);
-          },
-          [&] { return Esys_GetCapability_Finish(tpm.ctx(), &more, data.out()); });
+  TPMS_CAPABILITY_DATA data{};
+  if (Status status =
+          GetCapability(tpm, TPM2_CAP_HANDLES, kOwnKeysFirst, TPM2_MAX_CAP_HANDLES, &data);
       !status.ok()) {
     return status;
   }
   // A TPM holds a handful of persistent objects, far fewer than one answer
   // can list, so |more| is not followed.
-  const TPML_HANDLE& handles = data.get()->data.handles;
+  const TPML_HANDLE& handles = data.data.handles;
   for (uint32_t i = 0; i < handles.count; ++i) {
     const uint32_t handle = handles.handle[i];
     TPM2B_PUBLIC area{};
@@ -277,7 +254,7 @@ Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
     if (handle == keep) {
       return;
     }
-    if (Status status = EvictPersistent(tpm, handle); !status.ok()) {
+    if (Status status = EvictControl(tpm, handle, handle); !status.ok()) {
       result = status;
     }
   });

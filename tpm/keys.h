@@ -1,9 +1,9 @@
-// The platform key manager's operations on one connection (platform/tpm.h).
+// The platform key manager's operations on one connection (tpm/connection.h).
 // Each returns a Status; the C entry points (pcp.cpp) reduce it to 0 or 1.
 // The commands each flow sends are few on purpose: a discrete TPM takes tens
 // to hundreds of milliseconds for an asymmetric operation, so a boot sends
 // one (the RSA decrypt) and a regeneration one RSA key generation and at
-// most one primary. Private to platform/.
+// most one primary. Private to tpm/.
 #pragma once
 
 #include <cstdint>
@@ -41,12 +41,10 @@ Status EvictStaleKeys(Connection& tpm, const std::uint8_t* keepNameDigest);
 // to |handles|, as many as fit, and sets |*count| to how many there are.
 Status ListOwnKeys(Connection& tpm, std::span<std::uint32_t> handles, std::uint32_t* count);
 
-// The keys a sealed build creates (KEYMGR_SEAL_TO_VERDICT) require PCR
-// SealPcr() at the good boot verdict's value as well as their password; -1
-// when keys are plain. SetSealPcr changes it for the keys created and opened
-// from then on.
-int SealPcr();
-void SetSealPcr(int pcr);
+// A connection whose options name a seal PCR (a build with
+// KEYMGR_SEAL_TO_VERDICT) creates keys that require that PCR at the good
+// boot verdict's value as well as their password, and opens their fragments
+// in a policy session that meets it.
 // PcrSelection selects PCR |pcr| of the SHA-256 bank.
 TPML_PCR_SELECTION PcrSelection(int pcr);
 

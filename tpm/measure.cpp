@@ -3,7 +3,7 @@
 // this.
 #include <cstring>
 
-#include "tpm/connection.h"
+#include "tpm/commands.h"
 #include "tpm/pcp.h"
 
 using namespace keymgr::tpm;
@@ -14,24 +14,12 @@ int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest) {
   }
   SigpipeBlock sigpipe;
   Connection tpm;
-  if (!Connect(tpm).ok()) {
+  if (!Connect(tpm, BuildOptions()).ok()) {
     return 1;
   }
   TPML_DIGEST_VALUES values{};
   values.count = 1;
   values.digests[0].hashAlg = TPM2_ALG_SHA256;
   std::memcpy(values.digests[0].digest.sha256, digest, TPM2_SHA256_DIGEST_SIZE);
-  // A PCR of 0-15 needs the platform's empty auth, given as a password.
-  const ESYS_TR handle = ESYS_TR_PCR0 + pcr;
-  return Run(
-             tpm, "Esys_PCR_Extend",
-             [&] {
-               return Esys_PCR_Extend_Async(tpm.ctx(), handle, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                                            ESYS_TR_NONE, &values);
-             },
-             [&] {
-               return Esys_PCR_Extend_Finish(tpm.ctx());
-             }).ok()
-             ? 0
-             : 1;
+  return PcrExtend(tpm, pcr, ESYS_TR_PASSWORD, values).ok() ? 0 : 1;
 }

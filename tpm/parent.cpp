@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "crypto/hash.h"
-#include "tpm/connection.h"
+#include "tpm/commands.h"
 #include "util/random.h"
 
 namespace keymgr::tpm {
@@ -48,21 +48,9 @@ bool IsStandardSrk(const TPMT_PUBLIC& area) {
          ecc.kdf.scheme == want.kdf.scheme;
 }
 
-Status CreatePrimary(Connection& tpm) {
-  TPM2B_SENSITIVE_CREATE sensitive{};
-  const TPM2B_PUBLIC templ = SrkTemplate();
-  TPM2B_DATA outsideInfo{};
-  TPML_PCR_SELECTION pcrs{};
+Status CreateSrkPrimary(Connection& tpm) {
   ESYS_TR primary = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_CreatePrimary",
-      [&] {
-        return Esys_CreatePrimary_Async(tpm.ctx(), ESYS_TR_RH_OWNER, ESYS_TR_PASSWORD, ESYS_TR_NONE,
-                                        ESYS_TR_NONE, &sensitive, &templ, &outsideInfo, &pcrs);
-      },
-      [&] {
-        return Esys_CreatePrimary_Finish(tpm.ctx(), &primary, nullptr, nullptr, nullptr, nullptr);
-      });
+  Status status = CreatePrimary(tpm, SrkTemplate(), &primary);
   if (status.ok()) {
     tpm.primary.reset(tpm.Object(primary));
   }
@@ -79,13 +67,7 @@ Status OpenSrk(Connection& tpm) {
     return Refused("not the standard SRK");
   }
   ESYS_TR srk = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_TR_FromTPMPublic",
-      [&] {
-        return Esys_TR_FromTPMPublic_Async(tpm.ctx(), kSrkHandle, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE);
-      },
-      [&] { return Esys_TR_FromTPMPublic_Finish(tpm.ctx(), &srk); });
+  Status status = OpenPersistent(tpm, kSrkHandle, &srk);
   if (status.ok()) {
     tpm.srk.reset(tpm.Object(srk));
   }
@@ -103,7 +85,7 @@ Status UseParent(Connection& tpm) {
   if (OpenSrk(tpm).ok()) {
     return Status();
   }
-  return tpm.broken ? Refused("TPM connection lost") : CreatePrimary(tpm);
+  return tpm.broken ? Refused("TPM connection lost") : CreateSrkPrimary(tpm);
 }
 
 Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session, TPM2_SE type) {
@@ -111,7 +93,6 @@ Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* sess
   symmetric.algorithm = TPM2_ALG_AES;
   symmetric.keyBits.aes = 128;
   symmetric.mode.aes = TPM2_ALG_CFB;
-  *session = ESYS_TR_NONE;
   // Left to ESAPI, the nonce would come from OpenSSL's generator, which
   // waits for the kernel's pool. The TPM's nonce makes the session fresh;
   // this one need only differ from run to run, which the clock ensures
@@ -126,13 +107,7 @@ Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* sess
     (void)sha.Update(clocks, sizeof(clocks));
     (void)sha.Final(std::span<std::uint8_t, crypto::kSha256Size>(nonce.buffer, nonce.size));
   }
-  return Run(
-      tpm, "Esys_StartAuthSession",
-      [&] {
-        return Esys_StartAuthSession_Async(tpm.ctx(), tpmKey, bind, ESYS_TR_NONE, ESYS_TR_NONE,
-                                           ESYS_TR_NONE, &nonce, type, &symmetric, TPM2_ALG_SHA256);
-      },
-      [&] { return Esys_StartAuthSession_Finish(tpm.ctx(), session); });
+  return StartAuthSession(tpm, tpmKey, bind, nonce, type, symmetric, session);
 }
 
 Status UseSaltedSession(Connection& tpm, TPMA_SESSION attributes) {
@@ -157,21 +132,17 @@ Status PersistSrk(Connection& tpm) {
   if (OpenSrk(tpm).ok()) {
     return Status();
   }
-  if (Status status = CreatePrimary(tpm); !status.ok()) {
+  if (Status status = CreateSrkPrimary(tpm); !status.ok()) {
     return status;
   }
-  ESYS_TR persistent = ESYS_TR_NONE;
-  Status status = Run(
-      tpm, "Esys_EvictControl",
-      [&] {
-        return Esys_EvictControl_Async(tpm.ctx(), ESYS_TR_RH_OWNER, tpm.primary.get().tr,
-                                       ESYS_TR_PASSWORD, ESYS_TR_NONE, ESYS_TR_NONE, kSrkHandle);
-      },
-      [&] { return Esys_EvictControl_Finish(tpm.ctx(), &persistent); });
-  if (status.ok()) {
-    tpm.srk.reset(tpm.Object(persistent));
+  // The primary stays this connection's parent: it is the same key.
+  TPM2_HANDLE primary = 0;
+  if (Status status = Check("Esys_TR_GetTpmHandle",
+                            Esys_TR_GetTpmHandle(tpm.ctx(), tpm.primary.get().tr, &primary));
+      !status.ok()) {
+    return status;
   }
-  return status;
+  return EvictControl(tpm, primary, kSrkHandle);
 }
 
 }  // namespace keymgr::tpm

@@ -13,38 +13,43 @@ using keymgr::Secret;
 using keymgr::Status;
 using namespace keymgr::tpm;
 
-// The connection held by pcp_hold_connection, opened by the first call that
-// needs it.
-bool g_holding = false;
-std::optional<Connection> g_held;
-// Set when the held connection could not be opened or lost its TPM (a
-// command left unanswered past its deadline, a transport that failed).
-// Until the hold ends every call fails at once, so that a TPM that stops
-// answering costs one deadline per held call, not one per command.
-bool g_heldLost = false;
+// Held is the connection that pcp_hold_connection holds for the calls that
+// follow, opened by the first call that needs it. The C interface carries no
+// handle, so the one hold of this single-threaded module lives here.
+struct Held {
+  bool holding = false;
+  std::optional<Connection> connection;
+  // Set when the held connection could not be opened or lost its TPM (a
+  // command left unanswered past its deadline, a transport that failed).
+  // Until the hold ends every call fails at once, so that a TPM that stops
+  // answering costs one deadline per held call, not one per command.
+  bool lost = false;
+};
+Held g_held;
 
 // OnTpm runs |op| on the held connection, or on one of its own that closes
-// when the call ends. SIGPIPE stays blocked while the TPM is used.
+// when the call ends, opened with the build's options. SIGPIPE stays blocked
+// while the TPM is used.
 template <class Op>
 int OnTpm(Op op) {
-  if (g_holding && g_heldLost) {
+  if (g_held.holding && g_held.lost) {
     return 1;
   }
   SigpipeBlock sigpipe;
   std::optional<Connection> own;
-  std::optional<Connection>& slot = g_holding ? g_held : own;
+  std::optional<Connection>& slot = g_held.holding ? g_held.connection : own;
   if (!slot) {
     slot.emplace();
-    if (!Connect(*slot).ok()) {
+    if (!Connect(*slot, BuildOptions()).ok()) {
       slot.reset();
-      g_heldLost = g_holding;
+      g_held.lost = g_held.holding;
       return 1;
     }
   }
   const Status status = op(*slot);
   if (slot->broken) {
     slot.reset();
-    g_heldLost = g_holding;
+    g_held.lost = g_held.holding;
   }
   return status.ok() ? 0 : 1;
 }
@@ -52,15 +57,13 @@ int OnTpm(Op op) {
 }  // namespace
 
 void pcp_hold_connection(void) {
-  g_holding = true;
-  g_heldLost = false;
+  g_held.holding = true;
+  g_held.lost = false;
 }
 
 void pcp_release_connection(void) {
   SigpipeBlock sigpipe;
-  g_held.reset();
-  g_holding = false;
-  g_heldLost = false;
+  g_held = Held();
 }
 
 int pcp_getRandomBytes(uint32_t count, uint8_t* dst) {
@@ -130,14 +133,6 @@ int pcp_decryptDataFragment(const char* nameHex, const char* passHex, const uint
   return OnTpm([&](Connection& tpm) {
     return Unseal(tpm, nameHex, passHex, fragment, length, out, outSize);
   });
-}
-
-void pcp_set_transport_for_testing(const char* tcti, int deadlineMs) {
-  SetTransport(tcti, deadlineMs);
-}
-
-void pcp_set_seal_pcr_for_testing(int pcr) {
-  SetSealPcr(pcr);
 }
 
 int pcp_persist_srk(void) {

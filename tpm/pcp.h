@@ -85,20 +85,6 @@ PCP_NODISCARD int pcp_decryptDataFragment(const char* nameHex, const char* passH
 // bytes at |digest|, on a connection of its own.
 PCP_NODISCARD int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest);
 
-// pcp_set_seal_pcr_for_testing makes the keys created from now on require
-// PCR |pcr| of the SHA-256 bank at the good boot verdict's value, and opens
-// their fragments in a policy session that meets it, as a build with
-// KEYMGR_SEAL_TO_VERDICT does; -1 makes them plain keys again. For tests.
-void pcp_set_seal_pcr_for_testing(int pcr);
-
-// pcp_set_transport_for_testing makes the calls that follow open their
-// connections on |tcti| (a tpm2-tss TCTI configuration; "swtpm:" takes this
-// key manager's own transport) with a deadline of |deadlineMs| on every
-// command, in place of the build's KEYMGR_TCTI and KEYMGR_TPM_TIMEOUT_MS. A
-// null |tcti| restores those. For tests: a device uses what it was built
-// with. A connection already held keeps its transport.
-void pcp_set_transport_for_testing(const char* tcti, int deadlineMs);
-
 // pcp_persist_srk makes the standard storage root key persistent at
 // 0x81000001, or finds it there; keys are then created under it without
 // creating a primary each time.

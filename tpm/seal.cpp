@@ -6,6 +6,7 @@
 
 #include "crypto/hash.h"
 #include "crypto/rsa.h"
+#include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
 #include "util/secure.h"
@@ -14,36 +15,14 @@ namespace keymgr::tpm {
 
 namespace {
 
-TPMT_RSA_DECRYPT OaepSha256() {
-  TPMT_RSA_DECRYPT scheme{};
-  scheme.scheme = TPM2_ALG_OAEP;
-  scheme.details.oaep.hashAlg = TPM2_ALG_SHA256;
-  return scheme;
-}
-
 // MeetVerdictPolicy runs the policy of a key sealed to PCR |pcr| in
 // |session|: the PCR as it is now, then the key's password, which the
 // decryption's HMAC then carries.
 Status MeetVerdictPolicy(Connection& tpm, ESYS_TR session, int pcr) {
-  const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);
-  const TPM2B_DIGEST current{};  // the TPM takes the PCR's value as it stands
-  if (Status status = Run(
-          tpm, "Esys_PolicyPCR",
-          [&] {
-            return Esys_PolicyPCR_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
-                                        ESYS_TR_NONE, &current, &pcrs);
-          },
-          [&] { return Esys_PolicyPCR_Finish(tpm.ctx()); });
-      !status.ok()) {
+  if (Status status = PolicyPCR(tpm, session, PcrSelection(pcr)); !status.ok()) {
     return status;
   }
-  return Run(
-      tpm, "Esys_PolicyAuthValue",
-      [&] {
-        return Esys_PolicyAuthValue_Async(tpm.ctx(), session, ESYS_TR_NONE, ESYS_TR_NONE,
-                                          ESYS_TR_NONE);
-      },
-      [&] { return Esys_PolicyAuthValue_Finish(tpm.ctx()); });
+  return PolicyAuthValue(tpm, session);
 }
 
 }  // namespace
@@ -103,14 +82,7 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
   }
   const uint32_t handle = HandleOfName(nameHex);
   ESYS_TR tr = ESYS_TR_NONE;
-  if (Status status = Run(
-          tpm, "Esys_TR_FromTPMPublic",
-          [&] {
-            return Esys_TR_FromTPMPublic_Async(tpm.ctx(), handle, ESYS_TR_NONE, ESYS_TR_NONE,
-                                               ESYS_TR_NONE);
-          },
-          [&] { return Esys_TR_FromTPMPublic_Finish(tpm.ctx(), &tr); });
-      !status.ok()) {
+  if (Status status = OpenPersistent(tpm, handle, &tr); !status.ok()) {
     return status;
   }
   PersistentObject key(tpm.Object(tr));
@@ -129,7 +101,7 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
   // as binding would (tpm2-tss leaves it out of a bound policy session's
   // HMAC, where the TPM takes it in), so the response is encrypted all the
   // same.
-  const int pcr = SealPcr();
+  const int pcr = tpm.options.sealPcr;
   ESYS_TR bound = ESYS_TR_NONE;
   if (Status status = StartSession(tpm, ESYS_TR_NONE, pcr >= 0 ? ESYS_TR_NONE : tr, &bound,
                                    pcr >= 0 ? TPM2_SE_POLICY : TPM2_SE_HMAC);
@@ -149,20 +121,10 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
   TPM2B_PUBLIC_KEY_RSA cipher{};
   cipher.size = static_cast<uint16_t>(sealed.size());
   std::memcpy(cipher.buffer, sealed.data(), sealed.size());
-  const TPMT_RSA_DECRYPT scheme = OaepSha256();
-  TPM2B_DATA label{};
   SecretOutput<TPM2B_PUBLIC_KEY_RSA> message;
-  if (Status status = Run(
-          tpm, "Esys_RSA_Decrypt",
-          [&] {
-            return Esys_RSA_Decrypt_Async(tpm.ctx(), tr, bound, ESYS_TR_NONE, ESYS_TR_NONE, &cipher,
-                                          &scheme, &label);
-          },
-          [&] { return Esys_RSA_Decrypt_Finish(tpm.ctx(), message.out()); });
-      !status.ok()) {
+  if (Status status = RsaDecrypt(tpm, tr, bound, cipher, &message); !status.ok()) {
     return status;
   }
-  WipeResponse(tpm);
   // The TPM ended the session with the command, and ESAPI forgot it.
   (void)session.release();
   if (message.get()->size > *outSize || message.get()->size > sizeof(message.get()->buffer)) {

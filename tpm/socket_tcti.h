@@ -4,7 +4,7 @@
 // no timeout) and raises SIGPIPE when the simulator hangs up. Here every
 // connect, send and receive has a deadline, sends cannot raise SIGPIPE, and
 // the control channel is not used: the simulator's locality is 0 already.
-// Private to platform/.
+// Private to tpm/.
 #pragma once
 
 #include <tss2/tss2_tcti.h>

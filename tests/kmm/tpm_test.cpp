@@ -16,6 +16,7 @@
 #include "kmm/internal.h"
 #include "support/sandbox.h"
 #include "support/tpm_proxy.h"
+#include "support/tpm_settings.h"
 #include "tpm/pcp.h"
 #include "util/bytes.h"
 #include "util/paths.h"
@@ -33,9 +34,9 @@ struct OnProxy {
     // tpm2-tss's own transport also opens the simulator's control socket.
     std::filesystem::remove(kProxy + ".ctrl");
     std::filesystem::create_symlink(kSwtpm + ".ctrl", kProxy + ".ctrl");
-    pcp_set_transport_for_testing(tcti.c_str(), kDeadlineMs);
+    UseTransport(tcti, kDeadlineMs);
   }
-  ~OnProxy() { pcp_set_transport_for_testing(nullptr, 0); }
+  ~OnProxy() { UseBuildTransport(); }
   TpmProxy proxy{kProxy, kSwtpm};
 };
 
@@ -192,7 +193,7 @@ TEST(Tpm, EveryCommandFailedEndsInTimeAndLeavesOneKey) {
     return context;
   };
   std::string out;
-  pcp_set_transport_for_testing("swtpm:path=" KEYMGR_ROOT "/run/nobody.sock", kDeadlineMs);
+  UseTransport("swtpm:path=" KEYMGR_ROOT "/run/nobody.sock", kDeadlineMs);
   testing::internal::CaptureStderr();
   EXPECT_EQ(manage(KMM_OPTION_REGENERATE, &out), nullptr);
   EXPECT_NE(out.find("Failed to create OOK.\n"), std::string::npos) << out;
@@ -302,7 +303,7 @@ TEST(Tpm, TheVerdictIsMeasuredAttestedAndRequiredByASealedKey) {
   ASSERT_EQ(Tpm2({"tpm2_evictcontrol", "-c", in("ak.ctx"), "0x81010002"}).status, 0);
   ASSERT_EQ(Tpm2({"tpm2_flushcontext", "-t"}).status, 0);
   OnProxy bus;
-  pcp_set_seal_pcr_for_testing(14);
+  UseSealPcr(14);
   const std::string image = KEYMGR_EEPROM_PATH;
   const struct {
     const char* name;
@@ -373,7 +374,7 @@ TEST(Tpm, TheVerdictIsMeasuredAttestedAndRequiredByASealedKey) {
   const KeyContext* context = nullptr;
   Output([&] { context = KeyManage(KMM_OPTION_NORMAL_BOOT, 0); });
   EXPECT_NE(context, nullptr);
-  pcp_set_seal_pcr_for_testing(-1);
+  UseSealPcr(-1);
   EvictAllBut(keep);
 }
 

@@ -1,0 +1,38 @@
+#include "support/tpm_settings.h"
+
+#include "keymgr_build_config.h"
+#include "tpm/connection.h"
+
+namespace {
+
+std::string g_transport = KEYMGR_TCTI;
+keymgr::tpm::Options g_options = {nullptr, KEYMGR_TPM_TIMEOUT_MS, KEYMGR_SEAL_PCR};
+
+}  // namespace
+
+namespace keymgr::tpm {
+
+Options BuildOptions() {
+  Options options = g_options;
+  options.transport = g_transport.c_str();
+  return options;
+}
+
+}  // namespace keymgr::tpm
+
+namespace keymgr::test {
+
+void UseTransport(const std::string& tcti, int deadlineMs) {
+  g_transport = tcti;
+  g_options.deadlineMs = deadlineMs;
+}
+
+void UseBuildTransport() {
+  UseTransport(KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS);
+}
+
+void UseSealPcr(int pcr) {
+  g_options.sealPcr = pcr;
+}
+
+}  // namespace keymgr::test
