@@ -7,18 +7,20 @@
 # /dev/tpm0 and /dev/tpmrm0), an initramfs of busybox and the aarch64 device
 # build (scripts/package.sh --target aarch64), and an ext4 disk that keeps
 # /quorvan and the EEPROM image across boots. The guest's /init
-# (scripts/vm-init.sh) runs the installed etc/init.d/keymgr-boot start as a
-# device's init would, then the checks of its row, and reports them on the
-# console. Rows: provisioning, a normal boot, a listed file altered, a key
-# file altered, an unreadable EEPROM, a fresh TPM, a regeneration over the
-# key, a kernel panic during the boot proof and the boot after it; all with
-# the default transport device:/dev/tpmrm0, then again with a kmm-host built
-# for device:/dev/tpm0, and a few with the verdict measured into PCR 14 and
-# the key sealed to it. Then power cuts: the guest cuts its own power
-# (sysrq b: no sync) part way through kmm-host 3, and through keymgr hash
-# over a few thousand files, at KEYMGR_VM_CUTS points each (20 by default);
-# each next boot checks what the cut left. Last, e2fsck -n on the disks and
-# the keys of this system in each TPM, counted from the host.
+# (scripts/vm/init.sh) runs the row that the kernel command line names: its
+# file in scripts/vm/rows runs the installed etc/init.d/keymgr-boot start as
+# a device's init would, then its checks, with the helpers of
+# scripts/vm/lib.sh, and reports them on the console. Rows: provisioning, a
+# normal boot, a listed file altered, a key file altered, an unreadable
+# EEPROM, a fresh TPM, a regeneration over the key, a kernel panic during the
+# boot proof and the boot after it; all with the default transport
+# device:/dev/tpmrm0, then again with a kmm-host built for device:/dev/tpm0,
+# and a few with the verdict measured into PCR 14 and the key sealed to it.
+# Then power cuts: the guest cuts its own power (sysrq b: no sync) part way
+# through kmm-host 3, and through keymgr hash over a few thousand files, at
+# KEYMGR_VM_CUTS points each (20 by default); each next boot checks what the
+# cut left. Last, e2fsck -n on the disks and the keys of this system in each
+# TPM, counted from the host.
 # The kernel and busybox come from the machine's Debian sources through the
 # same private apt state as the sysroot, cached by version in build-vm/debs.
 # Each boot's console is kept in build-vm/logs.
@@ -110,7 +112,9 @@ ln -s usr/lib "$root/lib"
 cp "$build/target/bin/busybox" "$root/bin/"
 ln -s busybox "$root/bin/sh"
 cp -a "$package/install/." "$root/"
-install -m 755 scripts/vm-init.sh "$root/init"
+install -m 755 scripts/vm/init.sh "$root/init"
+mkdir -p "$root/usr/lib/vmtest"
+cp -r scripts/vm/lib.sh scripts/vm/rows "$root/usr/lib/vmtest/"
 
 # add_library SONAME: the library from the sysroot (or the unpacked
 # packages), and what it needs, under usr/lib/aarch64-linux-gnu.
