@@ -30,5 +30,5 @@ echo "== cppcheck"
 cppcheck --project="$build/compile_commands.json" --enable=warning,portability,performance \
   --std=c++20 --inline-suppr --error-exitcode=1 --quiet -j "$(nproc)"
 echo "== shellcheck"
-shellcheck scripts/*.sh bench/*.sh tests/dist/*.sh .ci/run
+shellcheck scripts/*.sh scripts/vm/*.sh scripts/vm/rows/*.sh bench/*.sh tests/dist/*.sh .ci/run
 echo "lint: clean"

@@ -7,18 +7,20 @@
 # /dev/tpm0 and /dev/tpmrm0), an initramfs of busybox and the aarch64 device
 # build (scripts/package.sh --target aarch64), and an ext4 disk that keeps
 # /quorvan and the EEPROM image across boots. The guest's /init
-# (scripts/vm-init.sh) runs the installed etc/init.d/keymgr-boot start as a
-# device's init would, then the checks of its row, and reports them on the
-# console. Rows: provisioning, a normal boot, a listed file altered, a key
-# file altered, an unreadable EEPROM, a fresh TPM, a regeneration over the
-# key, a kernel panic during the boot proof and the boot after it; all with
-# the default transport device:/dev/tpmrm0, then again with a kmm-host built
-# for device:/dev/tpm0, and a few with the verdict measured into PCR 14 and
-# the key sealed to it. Then power cuts: the guest cuts its own power
-# (sysrq b: no sync) part way through kmm-host 3, and through keymgr hash
-# over a few thousand files, at KEYMGR_VM_CUTS points each (20 by default);
-# each next boot checks what the cut left. Last, e2fsck -n on the disks and
-# the keys of this system in each TPM, counted from the host.
+# (scripts/vm/init.sh) runs the row that the kernel command line names: its
+# file in scripts/vm/rows runs the installed etc/init.d/keymgr-boot start as
+# a device's init would, then its checks, with the helpers of
+# scripts/vm/lib.sh, and reports them on the console. Rows: provisioning, a
+# normal boot, a listed file altered, a key file altered, an unreadable
+# EEPROM, a fresh TPM, a regeneration over the key, a kernel panic during the
+# boot proof and the boot after it; all with the default transport
+# device:/dev/tpmrm0, then again with a kmm-host built for device:/dev/tpm0,
+# and a few with the verdict measured into PCR 14 and the key sealed to it.
+# Then power cuts: the guest cuts its own power (sysrq b: no sync) part way
+# through kmm-host 3, and through keymgr hash over a few thousand files, at
+# KEYMGR_VM_CUTS points each (20 by default); each next boot checks what the
+# cut left. Last, e2fsck -n on the disks and the keys of this system in each
+# TPM, listed by a kmm-host built for this machine.
 # The kernel and busybox come from the machine's Debian sources through the
 # same private apt state as the sysroot, cached by version in build-vm/debs.
 # Each boot's console is kept in build-vm/logs.
@@ -60,6 +62,13 @@ variant() {
 variant tpm0 kmm-host -DKEYMGR_TCTI=device:/dev/tpm0
 # The verdict measured into PCR 14 and the key sealed to it.
 variant sealed "keymgr kmm-host" -DKEYMGR_MEASURE_PCR=14 -DKEYMGR_SEAL_TO_VERDICT=ON
+# kmm-host for this machine on a swtpm socket: it lists the keys that each
+# TPM state holds after the run, apart from the guest's own count.
+host_sock=$build/run/host.sock
+cmake -S . -B "$build/host-build" -G Ninja -DCMAKE_BUILD_TYPE=MinSizeRel -DBUILD_TESTING=OFF \
+  -DKEYMGR_ROOT= -DKEYMGR_TCTI="swtpm:path=$host_sock" >/dev/null
+cmake --build "$build/host-build" --target kmm-host -j 2
+host_kmm=$(find "$build/host-build" -type f -name kmm-host -perm -u+x | head -n 1)
 
 # --- Kernel and busybox -----------------------------------------------------
 tmp=$(mktemp -d)
@@ -110,7 +119,9 @@ ln -s usr/lib "$root/lib"
 cp "$build/target/bin/busybox" "$root/bin/"
 ln -s busybox "$root/bin/sh"
 cp -a "$package/install/." "$root/"
-install -m 755 scripts/vm-init.sh "$root/init"
+install -m 755 scripts/vm/init.sh "$root/init"
+mkdir -p "$root/usr/lib/vmtest"
+cp -r scripts/vm/lib.sh scripts/vm/rows "$root/usr/lib/vmtest/"
 
 # add_library SONAME: the library from the sysroot (or the unpacked
 # packages), and what it needs, under usr/lib/aarch64-linux-gnu.
@@ -236,35 +247,27 @@ boot() {
 }
 
 # host_keys STATE: the keys of this system in a powered-off TPM's state, as
-# tpm2-tools on the host see them: persistent handles from 0x81020000 to
-# 0x817fffff whose authPolicy is the marker (tpm/keys.cpp), counted
-# apart from the guest's own count.
+# the host's kmm-host lists them, one a line.
 host_keys() {
-  local sock=$build/run/host.sock tcti handle count=0 pid
-  tcti=swtpm:path=$sock
-  rm -f "$sock" "$sock.ctrl"
-  swtpm socket --tpm2 --tpmstate dir="$1" --server type=unixio,path="$sock" \
-    --ctrl type=unixio,path="$sock.ctrl" --flags not-need-init,startup-clear \
+  local pid status=0
+  rm -f "$host_sock" "$host_sock.ctrl"
+  swtpm socket --tpm2 --tpmstate dir="$1" --server type=unixio,path="$host_sock" \
+    --ctrl type=unixio,path="$host_sock.ctrl" --flags not-need-init,startup-clear \
     --log file="$build/run/swtpm.log" 2>>"$build/run/swtpm.log" &
   pid=$!
-  for _ in $(seq 100); do tpm2_getcap properties-fixed -T "$tcti" >/dev/null 2>&1 && break; sleep 0.05; done
-  for handle in $(tpm2_getcap handles-persistent -T "$tcti" | sed -n 's/^- //p'); do
-    if ((handle >= 0x81020000 && handle <= 0x817fffff)) &&
-      tpm2_readpublic -c "$handle" -T "$tcti" 2>/dev/null |
-      grep -q "6d922afdc6eca3f86bc5a593a1939a340ce7299b0e44810d2678c87b016584d6"; then
-      count=$((count + 1))
-    fi
-  done
-  tpm2_shutdown -T "$tcti" >/dev/null 2>&1 || true
+  pids=("$pid")
+  for _ in $(seq 100); do [ -S "$host_sock" ] && break; sleep 0.05; done
+  "$host_kmm" keys || status=$?
   kill "$pid" 2>/dev/null || true
   wait "$pid" 2>/dev/null || true
-  echo "$count"
+  pids=()
+  return "$status"
 }
 
 # after_series NAME DISK STATE: the disk is a clean file system and the TPM
 # holds one key of this system.
 after_series() {
-  local keys
+  local keys count
   if e2fsck -n -f "$2" >"$build/logs/$1-e2fsck.log" 2>&1; then
     passed=$((passed + 1))
     echo "  ok   $1: e2fsck -n finds the disk clean"
@@ -272,13 +275,17 @@ after_series() {
     failed=$((failed + 1))
     echo "  FAIL $1: e2fsck -n: see $build/logs/$1-e2fsck.log"
   fi
-  keys=$(host_keys "$3")
-  if [ "$keys" = 1 ]; then
+  if keys=$(host_keys "$3"); then
+    count=$(grep -c . <<<"$keys" || true)
+  else
+    count="an unknown number of"
+  fi
+  if [ "$count" = 1 ]; then
     passed=$((passed + 1))
-    echo "  ok   $1: the TPM holds 1 key of this system (tpm2-tools on the host)"
+    echo "  ok   $1: the TPM holds 1 key of this system (kmm-host keys on the host)"
   else
     failed=$((failed + 1))
-    echo "  FAIL $1: the TPM holds $keys keys of this system (tpm2-tools on the host), expected 1"
+    echo "  FAIL $1: the TPM holds $count keys of this system (kmm-host keys on the host), expected 1"
   fi
 }
 

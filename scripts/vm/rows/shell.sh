@@ -1,0 +1,12 @@
+#!/bin/sh
+# shellcheck shell=dash
+# For a boot by hand: the boot script, then a shell on the console. The
+# checks of a row run again with sh /usr/lib/vmtest/rows/ROW.sh.
+# shellcheck source=scripts/vm/lib.sh
+. /usr/lib/vmtest/lib.sh
+
+run_boot_script
+echo "boot script exit status $boot_status; $log holds:"
+cat "$log" 2>/dev/null
+echo "exit the shell to power off"
+setsid cttyhack sh
