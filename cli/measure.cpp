@@ -9,6 +9,7 @@
 #include "crypto/file_digest.h"
 #include "integrity/signature.h"
 #include "tpm/pcp.h"
+#include "util/hex.h"
 #include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"
@@ -25,7 +26,7 @@ void FileField(const char* name, const char* path, char* content, std::size_t si
   std::array<std::uint8_t, kFileDigestSize> digest{};
   if (*used < size && ComputeFileDigest(path, digest).ok()) {
     *used += static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"",
-                                                    name, verdict::DigestHex(digest).data()));
+                                                    name, HexText(digest, HexCase::kLower).data()));
   }
 }
 
@@ -74,7 +75,7 @@ void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
       std::snprintf(line, sizeof(line),
                     "{\"recnum\":0,\"pcr\":%u,\"digests\":[{\"hashAlg\":\"sha256\","
                     "\"digest\":\"%s\"}],\"content_type\":\"keymgr\",\"content\":%s}}\n",
-                    pcr, verdict::DigestHex(digest).data(), content);
+                    pcr, HexText(digest, HexCase::kLower).data(), content);
   // The log lies beside the status log and is kept with the same care. A
   // failed extend leaves it empty, so that it never claims an event the PCR
   // does not hold.

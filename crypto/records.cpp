@@ -8,11 +8,12 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <optional>
 
 #include "crypto/internal.h"
 #include "crypto/mask.h"
 #include "keymgr_build_config.h"
-#include "util/bytes.h"
+#include "util/hex.h"
 #include "util/secure.h"
 
 namespace keymgr::crypto {
@@ -31,30 +32,10 @@ constexpr std::array<std::uint8_t, kIvSize> kAesIv = {
 
 // The expected digest of the disk-mapper tool (constant 3), taken from the
 // build option at compile time; configure has already checked its form.
-constexpr std::size_t kDigestDigits = std::size_t{2} * kDigestSize;
-
-constexpr bool IsDigestText(const char* text) {
-  for (std::size_t i = 0; i < kDigestDigits; ++i) {
-    if (HexDigitValue(text[i]) < 0) {
-      return false;
-    }
-  }
-  return text[kDigestDigits] == '\0';
-}
-
-constexpr std::array<std::uint8_t, kDigestSize> ParseDigest(const char* text) {
-  std::array<std::uint8_t, kDigestSize> out{};
-  for (std::size_t i = 0; i < kDigestSize; ++i) {
-    out[i] =
-        static_cast<std::uint8_t>(HexDigitValue(text[2 * i]) * 16 + HexDigitValue(text[2 * i + 1]));
-  }
-  return out;
-}
-
-static_assert(sizeof(KEYMGR_DMSETUP_SHA256) == kDigestDigits + 1 &&
-                  IsDigestText(KEYMGR_DMSETUP_SHA256),
-              "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
-constexpr std::array<std::uint8_t, kDigestSize> kDmsetupDigest = ParseDigest(KEYMGR_DMSETUP_SHA256);
+constexpr std::optional<std::array<std::uint8_t, kDigestSize>> kParsedDmsetupDigest =
+    HexBytes<kDigestSize>(KEYMGR_DMSETUP_SHA256);
+static_assert(kParsedDmsetupDigest.has_value(), "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
+constexpr std::array<std::uint8_t, kDigestSize> kDmsetupDigest = *kParsedDmsetupDigest;
 
 // The library's process-wide state: the mask key, the nonce counter and the
 // records of the three constants. Constant 1 starts bound to nothing; the

@@ -1,12 +1,13 @@
 // The check of keymgr.sig in a signed build (one with KEYMGR_DIGEST_PUBKEY).
 #include <cstdlib>
 #include <cstring>
+#include <optional>
 
 #include "integrity/internal.h"
 #include "integrity/signature.h"
 #include "keymgr_digest_key.h"
-#include "util/bytes.h"
 #include "util/debug_print.h"
+#include "util/hex.h"
 
 namespace keymgr::integrity {
 
@@ -16,15 +17,9 @@ namespace {
 // manifest of ten thousand entries and its digest file are far smaller.
 constexpr std::size_t kMaxSignedFile = std::size_t{16} << 20;
 
-constexpr PublicKey ParseKey(const char (&hex)[65]) {
-  PublicKey key{};
-  for (std::size_t i = 0; i < key.size(); ++i) {
-    key[i] =
-        static_cast<std::uint8_t>(HexDigitValue(hex[2 * i]) << 4 | HexDigitValue(hex[2 * i + 1]));
-  }
-  return key;
-}
-constexpr PublicKey kDigestKey = ParseKey(KEYMGR_DIGEST_PUBKEY_HEX);
+constexpr std::optional<PublicKey> kParsedKey = HexBytes<32>(KEYMGR_DIGEST_PUBKEY_HEX);
+static_assert(kParsedKey.has_value(), "KEYMGR_DIGEST_PUBKEY_HEX must be 64 hex digits");
+constexpr PublicKey kDigestKey = *kParsedKey;
 
 // ReadWhole reads |stream| to its end into |bytes| and sets |size|.
 bool ReadWhole(std::FILE* stream, Owned<std::uint8_t*, SignedFiles::Free>& bytes,

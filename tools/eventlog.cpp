@@ -15,6 +15,7 @@
 #include <map>
 #include <string>
 
+#include "util/hex.h"
 #include "util/owned.h"
 #include "verdict/verdict.h"
 
@@ -29,7 +30,7 @@ int Fail(const std::string& what) {
 }
 
 std::string Hex(const PcrValue& value) {
-  return keymgr::verdict::DigestHex(value).data();
+  return keymgr::HexText(value, keymgr::HexCase::kLower).data();
 }
 
 // Field returns the text of |name|'s value in |line|: up to the next quote
@@ -53,20 +54,8 @@ bool ReadRecord(const std::string& line, unsigned* pcr, PcrValue* digest, std::s
   *verdict = Field(line, "verdict");
   char* end = nullptr;
   *pcr = static_cast<unsigned>(std::strtoul(index.c_str(), &end, 10));
-  if (index.empty() || *end != '\0' || *pcr > 23 || Field(line, "hashAlg") != "sha256" ||
-      Field(line, "content_type") != "keymgr" || hex.size() != 64) {
-    return false;
-  }
-  for (std::size_t i = 0; i < digest->size(); ++i) {
-    // Two hex digits exactly: strtoul alone would take a sign or a blank.
-    const char pair[3] = {hex[2 * i], hex[2 * i + 1], '\0'};
-    if (std::isxdigit(static_cast<unsigned char>(pair[0])) == 0 ||
-        std::isxdigit(static_cast<unsigned char>(pair[1])) == 0) {
-      return false;
-    }
-    (*digest)[i] = static_cast<std::uint8_t>(std::strtoul(pair, nullptr, 16));
-  }
-  return true;
+  return !index.empty() && *end == '\0' && *pcr <= 23 && Field(line, "hashAlg") == "sha256" &&
+         Field(line, "content_type") == "keymgr" && keymgr::HexDecode(hex, *digest);
 }
 
 }  // namespace

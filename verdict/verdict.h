@@ -28,8 +28,4 @@ PcrValue GoodPcrValue();
 // VerdictName is the verdict as the event log names it.
 const char* VerdictName(Verdict verdict);
 
-// DigestHex is |digest| in lower-case hex with a terminating NUL, as the
-// event log writes digests.
-std::array<char, 65> DigestHex(const PcrValue& digest);
-
 }  // namespace keymgr::verdict
