@@ -6,9 +6,9 @@ namespace keymgr::crypto {
 
 Status Ed25519Verify(std::span<const std::uint8_t, 32> key, std::span<const std::uint8_t> message,
                      std::span<const std::uint8_t, 64> signature) {
-  const Owned<EVP_PKEY*, EVP_PKEY_free> pkey(
+  const EvpPkey pkey(
       EVP_PKEY_new_raw_public_key(EVP_PKEY_ED25519, nullptr, key.data(), key.size()));
-  const Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context(EVP_MD_CTX_new());
+  const EvpMdContext context(EVP_MD_CTX_new());
   if (!pkey || !context ||
       EVP_DigestVerifyInit(context.get(), nullptr, nullptr, nullptr, pkey.get()) != 1) {
     return OpensslFailure("EVP_DigestVerifyInit");
@@ -31,7 +31,7 @@ Status Ed25519PublicKey(EVP_PKEY* key, std::span<std::uint8_t, 32> publicKey) {
 
 Status Ed25519Sign(EVP_PKEY* key, std::span<const std::uint8_t> message,
                    std::span<std::uint8_t, 64> signature) {
-  const Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context(EVP_MD_CTX_new());
+  const EvpMdContext context(EVP_MD_CTX_new());
   std::size_t size = signature.size();
   if (!context || EVP_DigestSignInit(context.get(), nullptr, nullptr, nullptr, key) != 1 ||
       EVP_DigestSign(context.get(), signature.data(), &size, message.data(), message.size()) != 1 ||

@@ -60,10 +60,6 @@ Status Ready(FileHasher& hasher) {
 
 }  // namespace
 
-void FileHasher::FreeBuffer(std::uint8_t* buffer) {
-  std::free(buffer);
-}
-
 HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   // Opened without blocking: a FIFO with no writer would otherwise hold the
   // boot run for ever. Opening first and asking the descriptor for the size

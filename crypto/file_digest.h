@@ -1,14 +1,12 @@
 // The SHA-256 digest of a listed file, streamed through a fixed buffer.
 #pragma once
 
-#include <openssl/evp.h>
-
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <span>
 
-#include "util/owned.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 namespace keymgr {
@@ -24,9 +22,8 @@ inline constexpr std::size_t kFileReadChunk = std::size_t{128} * 1024;
 // read buffer of kFileReadChunk bytes and a hash context, both taken at the
 // first use. One per thread.
 struct FileHasher {
-  static void FreeBuffer(std::uint8_t* buffer);
-  Owned<std::uint8_t*, FreeBuffer> buffer;
-  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context;
+  HeapBytes buffer;
+  crypto::EvpMdContext context;
 };
 
 // A file opened for hashing, with the size that stat gave it.

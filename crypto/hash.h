@@ -1,14 +1,12 @@
 // Message digests over OpenSSL EVP.
 #pragma once
 
-#include <openssl/evp.h>
-
 #include <array>
 #include <cstddef>
 #include <cstdint>
 #include <span>
 
-#include "util/owned.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 // Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
@@ -29,7 +27,7 @@ class Sha256 {
   Status Final(std::span<std::uint8_t, kSha256Size> digest);
 
  private:
-  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context_;
+  EvpMdContext context_;
   Status failed_;  // the first failure, kept until Final
 };
 

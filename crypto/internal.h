@@ -8,7 +8,7 @@
 #include <cstdint>
 
 #include "crypto/dtc.h"
-#include "util/owned.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 namespace keymgr::crypto {
@@ -20,9 +20,6 @@ inline constexpr std::uint32_t kIvSize = 16;
 // The module's keys are at most 48 bytes; the bound keeps a corrupt length
 // from running the fixed work buffers past their end.
 inline constexpr std::uint32_t kMaxLength = 1024;
-
-// The cipher context of an AES job.
-using CipherContext = Owned<EVP_CIPHER_CTX*, EVP_CIPHER_CTX_free>;
 
 // OpensslFailure names a failed libcrypto call with the error it queued.
 inline Status OpensslFailure(const char* call) {

@@ -24,6 +24,7 @@
 #include "crypto/ed25519.h"
 #include "crypto/file_digest.h"
 #include "crypto/hash.h"
+#include "crypto/openssl_handles.h"
 #include "integrity/manifest.h"
 #include "integrity/signature.h"
 #include "util/atomic_file.h"
@@ -151,8 +152,8 @@ int Sign(const Args& args, std::span<const std::uint8_t> manifest,
          std::span<const std::uint8_t> digests,
          std::span<std::uint8_t, keymgr::integrity::kSignatureFileSize> bytes) {
   const keymgr::File pem(std::fopen(args.key.c_str(), "r"));
-  const keymgr::Owned<EVP_PKEY*, EVP_PKEY_free> key(
-      pem ? PEM_read_PrivateKey(pem.get(), nullptr, nullptr, nullptr) : nullptr);
+  const keymgr::crypto::EvpPkey key(pem ? PEM_read_PrivateKey(pem.get(), nullptr, nullptr, nullptr)
+                                        : nullptr);
   keymgr::integrity::SignatureFile file;
   file.counter = args.counter;
   file.listDigest = keymgr::crypto::Sha256Of(manifest);
