@@ -23,7 +23,7 @@ namespace {
 // can be hashed.
 void FileField(const char* name, const char* path, char* content, std::size_t size,
                std::size_t* used) {
-  std::array<std::uint8_t, kFileDigestSize> digest{};
+  std::array<std::uint8_t, crypto::kSha256Size> digest{};
   if (*used < size && ComputeFileDigest(path, digest).ok()) {
     *used += static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"",
                                                     name, HexText(digest, HexCase::kLower).data()));

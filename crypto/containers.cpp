@@ -82,7 +82,7 @@ uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector, const Pro
   if (inLength > kMaxLength) {
     return DTC_E_BAD_LENGTH;
   }
-  if (*outLength < kDigestSize) {
+  if (*outLength < kSha256Size) {
     return DTC_E_SMALL_OUTPUT;
   }
   container->phase = Phase::kDone;
@@ -94,11 +94,11 @@ uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector, const Pro
   Secret<EVP_MAX_MD_SIZE> digest;
   unsigned int produced = 0;
   if (EVP_Digest(plain.data(), inLength, digest.data(), &produced, EVP_sha256(), nullptr) != 1 ||
-      produced != kDigestSize) {
+      produced != kSha256Size) {
     return Backend("EVP_Digest");
   }
-  Store(out, digest.data(), kDigestSize);
-  *outLength = kDigestSize;
+  Store(out, digest.data(), kSha256Size);
+  *outLength = kSha256Size;
   return 0;
 }
 

@@ -90,7 +90,7 @@ HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon) {
 }
 
 Status HashOpenFile(FileHasher& hasher, FileToHash& file,
-                    std::span<std::uint8_t, kFileDigestSize> digest,
+                    std::span<std::uint8_t, crypto::kSha256Size> digest,
                     const std::atomic<bool>* stop) {
   const Descriptor fd = std::move(file.fd);
   if (Status status = Ready(hasher); !status.ok()) {
@@ -123,11 +123,12 @@ Status HashOpenFile(FileHasher& hasher, FileToHash& file,
   if (EVP_DigestFinal_ex(hasher.context.get(), out, nullptr) != 1) {
     return crypto::OpensslFailure("EVP_DigestFinal_ex");
   }
-  std::memcpy(digest.data(), out, kFileDigestSize);
+  std::memcpy(digest.data(), out, crypto::kSha256Size);
   return Status();
 }
 
-HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest) {
+HashResult ComputeFileDigest(const char* path,
+                             std::span<std::uint8_t, crypto::kSha256Size> digest) {
   FileToHash file;
   if (HashResult opened = OpenFileToHash(path, file, false); !opened.ok()) {
     return opened;

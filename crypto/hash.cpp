@@ -11,7 +11,7 @@ int Md5OfString(const char* text, std::uint8_t* digest) {
   unsigned int size = 0;
   if (EVP_Digest(text, std::strlen(text), digest, &size, EVP_md5(), nullptr) != 1) {
     (void)keymgr::crypto::OpensslFailure("EVP_Digest");
-    std::memset(digest, 0, 16);
+    std::memset(digest, 0, keymgr::crypto::kMd5Size);
   }
   return 0;
 }

@@ -9,14 +9,15 @@
 #include "crypto/openssl_handles.h"
 #include "util/status.h"
 
-// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
-// bytes at |digest|. Always returns 0; should libcrypto fail, |digest| is
-// zeroed, which no identity or password ever hashes to.
+// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the
+// keymgr::crypto::kMd5Size (16) bytes at |digest|. Always returns 0; should libcrypto fail,
+// |digest| is zeroed, which no identity or password ever hashes to.
 int Md5OfString(const char* text, std::uint8_t* digest);
 
 namespace keymgr::crypto {
 
 inline constexpr std::size_t kSha256Size = 32;
+inline constexpr std::size_t kMd5Size = 16;
 
 // Sha256 hashes a stream of bytes: Update as often as needed, then Final.
 class Sha256 {

@@ -8,12 +8,12 @@
 #include <cstdint>
 
 #include "crypto/dtc.h"
+#include "crypto/hash.h"
 #include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 namespace keymgr::crypto {
 
-inline constexpr std::uint32_t kDigestSize = 32;
 inline constexpr std::uint32_t kAesKeySize = 32;
 inline constexpr std::uint32_t kAesBlockSize = 16;
 inline constexpr std::uint32_t kIvSize = 16;

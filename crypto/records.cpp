@@ -32,10 +32,10 @@ constexpr std::array<std::uint8_t, kIvSize> kAesIv = {
 
 // The expected digest of the disk-mapper tool (constant 3), taken from the
 // build option at compile time; configure has already checked its form.
-constexpr std::optional<std::array<std::uint8_t, kDigestSize>> kParsedDmsetupDigest =
-    HexBytes<kDigestSize>(KEYMGR_DMSETUP_SHA256);
+constexpr std::optional<std::array<std::uint8_t, kSha256Size>> kParsedDmsetupDigest =
+    HexBytes<kSha256Size>(KEYMGR_DMSETUP_SHA256);
 static_assert(kParsedDmsetupDigest.has_value(), "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
-constexpr std::array<std::uint8_t, kDigestSize> kDmsetupDigest = *kParsedDmsetupDigest;
+constexpr std::array<std::uint8_t, kSha256Size> kDmsetupDigest = *kParsedDmsetupDigest;
 
 // The library's process-wide state: the mask key, the nonce counter and the
 // records of the three constants. Constant 1 starts bound to nothing; the
@@ -47,7 +47,7 @@ struct Library {
   ProtectedKey aesKey;
   std::array<std::uint8_t, kIvSize> ivBytes;
   ProtectedKey iv;
-  std::array<std::uint8_t, kDigestSize> dmsetupBytes;
+  std::array<std::uint8_t, kSha256Size> dmsetupBytes;
   ProtectedKey dmsetup;
 };
 
@@ -65,7 +65,7 @@ bool InitLibrary(Library& lib) {
   lib.lastNonce = 0;
   lib.aesKey = ProtectedKey{};
   SealConstant(lib, lib.iv, kAesIv.data(), lib.ivBytes.data(), kIvSize);
-  SealConstant(lib, lib.dmsetup, kDmsetupDigest.data(), lib.dmsetupBytes.data(), kDigestSize);
+  SealConstant(lib, lib.dmsetup, kDmsetupDigest.data(), lib.dmsetupBytes.data(), kSha256Size);
   return true;
 }
 
@@ -135,7 +135,7 @@ uint32_t VKT_DTC_GetConstant(uint32_t index, ProtectedKey** ref, uint32_t* lengt
       return 0;
     case DTC_CONST_DMSETUP_DIGEST:
       *ref = &lib.dmsetup;
-      *length = kDigestSize;
+      *length = kSha256Size;
       return 0;
     default:
       *ref = nullptr;

@@ -17,7 +17,7 @@
 
 namespace keymgr::integrity {
 
-using Digest = std::array<std::uint8_t, kFileDigestSize>;
+using Digest = std::array<std::uint8_t, crypto::kSha256Size>;
 #if KEYMGR_SIGNED_BUILD
 // SignedFiles holds the bytes that keymgr.sig covers, read once. Check reads
 // the digest file and the manifest whole, checks keymgr.sig against them and

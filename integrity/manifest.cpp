@@ -12,7 +12,6 @@
 namespace {
 
 using keymgr::File;
-using keymgr::kFileDigestSize;
 using namespace keymgr::integrity;
 
 void PrintOpenError(const char* path) {
@@ -108,7 +107,7 @@ void PrintOutcome(const EntryBuffer& entry, bool matches) {
 }
 
 bool SameDigest(const Digest& a, const Digest& b) {
-  return std::memcmp(a.data(), b.data(), kFileDigestSize) == 0;
+  return std::memcmp(a.data(), b.data(), a.size()) == 0;
 }
 
 // OpenManifest opens the manifest, printing its open error on failure.

@@ -20,8 +20,8 @@ void EncodeSignatureFile(const SignatureFile& file,
   StoreBig32(out.data() + 4, file.version);
   std::memcpy(out.data() + 8, file.keyId.data(), file.keyId.size());
   StoreBig64(out.data() + 16, file.counter);
-  std::memcpy(out.data() + 24, file.listDigest.data(), 32);
-  std::memcpy(out.data() + 56, file.digestsDigest.data(), 32);
+  std::memcpy(out.data() + 24, file.listDigest.data(), file.listDigest.size());
+  std::memcpy(out.data() + 56, file.digestsDigest.data(), file.digestsDigest.size());
   std::memcpy(out.data() + kSignedSize, file.signature.data(), file.signature.size());
 }
 
@@ -33,8 +33,8 @@ Status DecodeSignatureFile(std::span<const std::uint8_t> bytes, SignatureFile* f
   file->version = LoadBig32(bytes.data() + 4);
   std::memcpy(file->keyId.data(), bytes.data() + 8, file->keyId.size());
   file->counter = LoadBig64(bytes.data() + 16);
-  std::memcpy(file->listDigest.data(), bytes.data() + 24, 32);
-  std::memcpy(file->digestsDigest.data(), bytes.data() + 56, 32);
+  std::memcpy(file->listDigest.data(), bytes.data() + 24, file->listDigest.size());
+  std::memcpy(file->digestsDigest.data(), bytes.data() + 56, file->digestsDigest.size());
   std::memcpy(file->signature.data(), bytes.data() + kSignedSize, file->signature.size());
   return Status();
 }

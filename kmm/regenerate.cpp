@@ -25,8 +25,8 @@ int RegenerateKey(KeyContext* context) {
   // The digest is stored before the store key is sealed and written: a later
   // failure leaves the new digest beside the old store key, and the next boot
   // reports the mismatch until a regeneration succeeds.
-  std::array<std::uint8_t, kDigestSize> digest{};
-  if (GenerateMessageDigest(kDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
+  std::array<std::uint8_t, kScDigestSize> digest{};
+  if (GenerateMessageDigest(kScDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
     DebugPrint("Generate Message Digest Error!!!\n");
     return 1;
   }
@@ -85,7 +85,7 @@ int GenerateSeedKey(KeyContext* context) {
 }
 
 int GenerateSecretKey(KeyContext* context) {
-  static_assert(kSecretKeySize == kDigestSize);
+  static_assert(kSecretKeySize == kScDigestSize);
   context->secretKeyLength = kSecretKeySize;  // capacity going in
   Attach(&context->secretKeyPK, context->secretKeyBytes);
   if (HashRecord(&context->seedKeyPK, kSeedKeySize, &context->secretKeyPK,

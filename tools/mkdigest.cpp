@@ -203,7 +203,7 @@ int main(int argc, char** argv) {
   while (entries &&
          (read = keymgr::integrity::ReadEntry(entries.get(), entry)) == EntryRead::kEntry) {
     const std::string path = InRoot(args.root, entry.data());
-    std::array<std::uint8_t, keymgr::kFileDigestSize> digest{};
+    std::array<std::uint8_t, keymgr::crypto::kSha256Size> digest{};
     const keymgr::HashResult hashed = path.empty()
                                           ? keymgr::HashResult{keymgr::HashResult::kStat, {}}
                                           : keymgr::ComputeFileDigest(path.c_str(), digest);

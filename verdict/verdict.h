@@ -7,11 +7,13 @@
 #include <array>
 #include <cstdint>
 
+#include "crypto/hash.h"
+
 namespace keymgr::verdict {
 
 enum class Verdict { kOk, kFail, kNone };
 
-using PcrValue = std::array<std::uint8_t, 32>;
+using PcrValue = std::array<std::uint8_t, crypto::kSha256Size>;
 
 // VerdictDigest is the SHA-256 of "keymgr boot verdict: " and BN=OK,
 // BN=FAIL, or "none" for a run that verified nothing.
