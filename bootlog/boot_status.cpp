@@ -75,7 +75,7 @@ void WriteBootStatus(unsigned int code) {
       path, startsLog ? O_WRONLY | O_CREAT | O_TRUNC : O_RDWR | O_CREAT | O_APPEND, nullptr,
       keymgr::Look::kOwnName);
   if (!log) {
-    (void)keymgr::ErrnoFailure("open");
+    keymgr::LogErrno("open");
     DebugPrint("file[%s] open error!!\n", path);
     return;
   }
@@ -85,13 +85,13 @@ void WriteBootStatus(unsigned int code) {
     // The boot script reads the outcome from here only: a line that did not
     // reach the file is named on request, though its result stays as it was.
     if (!keymgr::WriteAll(log.get(), line.text, line.length)) {
-      (void)keymgr::ErrnoFailure("write");
+      keymgr::LogErrno("write");
     }
   } else {
     DebugPrint("Unknown flag!!\n");
   }
   if (::close(log.release()) != 0) {
-    (void)keymgr::ErrnoFailure("close");
+    keymgr::LogErrno("close");
   }
 }
 

@@ -57,7 +57,7 @@ void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
   const verdict::PcrValue digest = verdict::VerdictDigest(verdict);
   const bool extended = pcp_extend_pcr(pcr, digest.data()) == 0;
   if (!extended) {
-    (void)Refused("extend of the boot verdict");
+    LogRefused("extend of the boot verdict");
   }
   // The record of the event: the TCG canonical event log's JSON form, one
   // record a line. What it names beside the verdict is for a verifier; only
@@ -83,7 +83,7 @@ void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
       OpenRegular(kEventLogPath, O_WRONLY | O_CREAT | O_TRUNC, nullptr, Look::kOwnName);
   if (!log ||
       (extended && length > 0 && !WriteAll(log.get(), line, static_cast<std::size_t>(length)))) {
-    (void)ErrnoFailure("event log");
+    LogErrno(!log ? "open" : "write");
   }
 }
 

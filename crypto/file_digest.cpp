@@ -51,7 +51,7 @@ Status Ready(FileHasher& hasher) {
   }
   // A hash that cannot run fails like a buffer that cannot be had.
   if (!hasher.buffer || !hasher.context) {
-    return ErrnoFailure("aligned_alloc", ENOMEM);
+    return ErrnoFailure(hasher.buffer ? "EVP_MD_CTX_new" : "aligned_alloc", ENOMEM);
   }
   return EVP_DigestInit_ex(hasher.context.get(), EVP_sha256(), nullptr) == 1
              ? Status()

@@ -49,7 +49,7 @@ int GenerateSeedKey(KeyContext* context) {
   // The random words are only as good as the generator's state: a host that
   // never filled it would get a key found by searching a day of timestamps.
   if (!SeedRandomOnce()) {
-    (void)keymgr::Refused("no source of randomness for the seed key");
+    keymgr::LogRefused("no source of randomness for the seed key");
     return 1;
   }
   std::array<char, 12> date{};
