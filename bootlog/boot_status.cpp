@@ -36,8 +36,6 @@ static_assert(std::size(kStatusLines) == kLastStatusCode + 1);
 
 static_assert(sizeof(keymgr::kBootLogPath) <= keymgr::kPathBufferSize);
 
-int g_lastVerdict = -1;
-
 }  // namespace
 
 unsigned int CheckSecurityFeature() {
@@ -60,7 +58,6 @@ void WriteBootStatus(unsigned int code) {
   // Only the manifest verification issues the BN codes, and it already runs
   // behind the EEPROM gate; every later line needs SFE_003 on.
   const bool startsLog = code == kBootStatusBnOk || code == kBootStatusBnFail;
-  g_lastVerdict = startsLog ? static_cast<int>(code) : g_lastVerdict;
   if (!startsLog && CheckSecurityFeature() != 1) {
     return;
   }
@@ -93,8 +90,4 @@ void WriteBootStatus(unsigned int code) {
   if (::close(log.release()) != 0) {
     keymgr::LogErrno("close");
   }
-}
-
-int LastBootVerdict() {
-  return g_lastVerdict;
 }

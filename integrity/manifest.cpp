@@ -220,6 +220,12 @@ void VerifyManifestFile(const char* path) {
 }
 
 int VerifyManifest(int verbose) {
+  keymgr::verdict::Verdict verdict = keymgr::verdict::Verdict::kNone;
+  return VerifyManifestVerdict(verbose, &verdict);
+}
+
+int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict) {
+  using keymgr::verdict::Verdict;
   Outcome outcome = kAllPassed;
   SignedFiles held;  // outlives the streams that may read its bytes
   File digests;
@@ -227,6 +233,7 @@ int VerifyManifest(int verbose) {
   if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, verbose == 1)) {
     CloseBoth(digests, manifest);
     WriteBootStatus(kBootStatusBnFail);
+    *verdict = Verdict::kFail;
     return 1;
   }
   {
@@ -259,5 +266,6 @@ int VerifyManifest(int verbose) {
   // The outcome travels only in the status line; the result says whether the
   // files could be opened and read.
   WriteBootStatus(outcome != kAllPassed ? kBootStatusBnFail : kBootStatusBnOk);
+  *verdict = outcome != kAllPassed ? Verdict::kFail : Verdict::kOk;
   return outcome == kUnreadable ? 1 : 0;
 }
