@@ -7,6 +7,7 @@
 #include "bootlog/boot_status.h"
 #include "integrity/internal.h"
 #include "util/atomic_file.h"
+#include "util/bytes.h"
 #include "util/debug_print.h"
 
 namespace {
@@ -92,10 +93,7 @@ bool ReadRecord(std::FILE* digests, Digest& record) {
 
 void PrintDigest(const char* label, const Digest& digest) {
   DebugPrint("%s", label);
-  for (std::uint8_t byte : digest) {
-    DebugPrint("%02X ", byte);
-  }
-  DebugPrint("\n");
+  PrintHexDump(digest.data(), digest.size(), 0);
 }
 
 void PrintOutcome(const EntryBuffer& entry, bool matches) {

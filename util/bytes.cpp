@@ -1,7 +1,6 @@
 #include "util/bytes.h"
 
 #include <cstddef>
-#include <cstring>
 
 #include "util/debug_print.h"
 #include "util/hex.h"
