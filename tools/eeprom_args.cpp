@@ -80,7 +80,7 @@ EepromArgs ParseEepromArgs(int argc, const char* const* argv,
       return EepromArgs();
     }
     // A region takes exactly its own length.
-    if (digits == 0 || digits % 2 != 0 || (region != nullptr && digits != 2 * region->length)) {
+    if (digits == 0 || digits % 2 != 0 || (region != nullptr && digits / 2 != region->length)) {
       return EepromArgs();
     }
     args.action = Action::kWrite;
