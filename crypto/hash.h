@@ -10,7 +10,7 @@
 #include "util/status.h"
 
 // Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the
-// keymgr::crypto::kMd5Size (16) bytes at |digest|. Always returns 0; should libcrypto fail,
+// kMd5Size (16) bytes at |digest|. Always returns 0; should libcrypto fail,
 // |digest| is zeroed, which no identity or password ever hashes to.
 int Md5OfString(const char* text, std::uint8_t* digest);
 

@@ -25,23 +25,11 @@ constexpr void StoreBig(std::uint8_t* at, Int value) {
   }
 }
 
-constexpr std::uint16_t LoadBig16(const std::uint8_t* at) {
-  return LoadBig<std::uint16_t>(at);
-}
-constexpr std::uint32_t LoadBig32(const std::uint8_t* at) {
-  return LoadBig<std::uint32_t>(at);
-}
-constexpr std::uint64_t LoadBig64(const std::uint8_t* at) {
-  return LoadBig<std::uint64_t>(at);
-}
-constexpr void StoreBig16(std::uint8_t* at, std::uint16_t value) {
-  StoreBig(at, value);
-}
-constexpr void StoreBig32(std::uint8_t* at, std::uint32_t value) {
-  StoreBig(at, value);
-}
-constexpr void StoreBig64(std::uint8_t* at, std::uint64_t value) {
-  StoreBig(at, value);
-}
+inline constexpr auto LoadBig16 = &LoadBig<std::uint16_t>;
+inline constexpr auto LoadBig32 = &LoadBig<std::uint32_t>;
+inline constexpr auto LoadBig64 = &LoadBig<std::uint64_t>;
+inline constexpr auto StoreBig16 = &StoreBig<std::uint16_t>;
+inline constexpr auto StoreBig32 = &StoreBig<std::uint32_t>;
+inline constexpr auto StoreBig64 = &StoreBig<std::uint64_t>;
 
 }  // namespace keymgr

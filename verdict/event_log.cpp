@@ -11,8 +11,6 @@ namespace keymgr::verdict {
 
 namespace {
 
-constexpr Verdict kVerdicts[] = {Verdict::kOk, Verdict::kFail, Verdict::kNone};
-
 // Writer and Reader walk a record's text through Layout, one writing it and
 // the other taking it apart, so that both follow the same layout. Each call
 // returns false when the line is full, or does not go on as the layout says.
@@ -73,7 +71,7 @@ struct Reader {
     return true;
   }
   bool Value(Verdict& verdict) {
-    for (const Verdict named : kVerdicts) {
+    for (const Verdict named : {Verdict::kOk, Verdict::kFail, Verdict::kNone}) {
       if (Literal(VerdictName(named))) {
         verdict = named;
         return true;
@@ -96,7 +94,8 @@ struct Reader {
 };
 
 // Layout is the record's text, field by field; |event| is an Event, const
-// for the Writer.
+// for the Writer. The content after content_type is a verdict event's; an
+// event of another kind would lay out its own there.
 template <class Io, class E>
 bool Layout(Io& io, E& event) {
   return io.Literal("{\"recnum\":") && io.Value(event.recnum) && io.Literal(",\"pcr\":") &&
