@@ -36,8 +36,6 @@ static_assert(std::size(kStatusLines) == kLastStatusCode + 1);
 
 static_assert(sizeof(keymgr::kBootLogPath) <= keymgr::kPathBufferSize);
 
-int g_lastVerdict = -1;
-
 }  // namespace
 
 unsigned int CheckSecurityFeature() {
@@ -60,7 +58,6 @@ void WriteBootStatus(unsigned int code) {
   // Only the manifest verification issues the BN codes, and it already runs
   // behind the EEPROM gate; every later line needs SFE_003 on.
   const bool startsLog = code == kBootStatusBnOk || code == kBootStatusBnFail;
-  g_lastVerdict = startsLog ? static_cast<int>(code) : g_lastVerdict;
   if (!startsLog && CheckSecurityFeature() != 1) {
     return;
   }
@@ -75,7 +72,7 @@ void WriteBootStatus(unsigned int code) {
       path, startsLog ? O_WRONLY | O_CREAT | O_TRUNC : O_RDWR | O_CREAT | O_APPEND, nullptr,
       keymgr::Look::kOwnName);
   if (!log) {
-    (void)keymgr::ErrnoFailure("open");
+    keymgr::LogErrno("open");
     DebugPrint("file[%s] open error!!\n", path);
     return;
   }
@@ -85,16 +82,12 @@ void WriteBootStatus(unsigned int code) {
     // The boot script reads the outcome from here only: a line that did not
     // reach the file is named on request, though its result stays as it was.
     if (!keymgr::WriteAll(log.get(), line.text, line.length)) {
-      (void)keymgr::ErrnoFailure("write");
+      keymgr::LogErrno("write");
     }
   } else {
     DebugPrint("Unknown flag!!\n");
   }
   if (::close(log.release()) != 0) {
-    (void)keymgr::ErrnoFailure("close");
+    keymgr::LogErrno("close");
   }
-}
-
-int LastBootVerdict() {
-  return g_lastVerdict;
 }

@@ -15,7 +15,3 @@ unsigned int CheckSecurityFeature();
 // it. Codes 0 and 1 start the log anew; every other code is appended, and
 // only when SFE_003 is set.
 void WriteBootStatus(unsigned int code);
-
-// LastBootVerdict is the BN code (0 or 1) that WriteBootStatus last issued in
-// this process, or -1 when it issued none.
-int LastBootVerdict();

@@ -65,12 +65,9 @@ int main(int argc, char** argv) {
   }
 #ifdef KEYMGR_MEASURE_PCR
   // One event a boot run: the verdict, or that nothing was verified.
-  using keymgr::verdict::Verdict;
-  const int result = enabled == 1 ? VerifyManifest(command.verbose) : 0;
-  const int verdict = enabled == 1 ? LastBootVerdict() : -1;
-  keymgr::cli::MeasureVerdict(KEYMGR_MEASURE_PCR, verdict == 0   ? Verdict::kOk
-                                                  : verdict == 1 ? Verdict::kFail
-                                                                 : Verdict::kNone);
+  keymgr::verdict::Verdict verdict = keymgr::verdict::Verdict::kNone;
+  const int result = enabled == 1 ? VerifyManifestVerdict(command.verbose, &verdict) : 0;
+  keymgr::cli::MeasureVerdict(KEYMGR_MEASURE_PCR, verdict);
   return Finish(result);
 #else
   if (enabled != 1) {

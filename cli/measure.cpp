@@ -5,6 +5,7 @@
 #include <array>
 #include <cstdint>
 #include <cstdio>
+#include <optional>
 
 #include "crypto/file_digest.h"
 #include "integrity/signature.h"
@@ -13,76 +14,64 @@
 #include "util/owned.h"
 #include "util/paths.h"
 #include "util/status.h"
+#include "verdict/event_log.h"
 
 namespace keymgr::cli {
 
 namespace {
 
-// FileField appends ,"NAME":"SHA-256 of PATH" to |content| when the file
-// can be hashed.
-void FileField(const char* name, const char* path, char* content, std::size_t size,
-               std::size_t* used) {
-  std::array<std::uint8_t, kFileDigestSize> digest{};
-  if (*used < size && ComputeFileDigest(path, digest).ok()) {
-    *used += static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"%s\":\"%s\"",
-                                                    name, verdict::DigestHex(digest).data()));
+// FileDigest is the SHA-256 of the file at |path|, when it can be hashed.
+std::optional<verdict::PcrValue> FileDigest(const char* path) {
+  verdict::PcrValue digest{};
+  if (!ComputeFileDigest(path, digest).ok()) {
+    return std::nullopt;
   }
+  return digest;
 }
 
-// ReleaseField appends ,"release":N, the counter of keymgr.sig, when a
-// signed build reads one.
-void ReleaseField(char* content, std::size_t size, std::size_t* used) {
+// Release is the counter of keymgr.sig, when a signed build reads one.
+std::optional<std::uint64_t> Release() {
 #if KEYMGR_SIGNED_BUILD
   std::array<std::uint8_t, integrity::kSignatureFileSize> bytes{};
   integrity::SignatureFile signature;
   const File file = OpenFile(kSignaturePath, "r");
-  if (*used < size && file &&
-      std::fread(bytes.data(), 1, bytes.size(), file.get()) == bytes.size() &&
+  if (file && std::fread(bytes.data(), 1, bytes.size(), file.get()) == bytes.size() &&
       integrity::DecodeSignatureFile(bytes, &signature).ok()) {
-    *used +=
-        static_cast<std::size_t>(std::snprintf(content + *used, size - *used, ",\"release\":%llu",
-                                               static_cast<unsigned long long>(signature.counter)));
+    return signature.counter;
   }
-#else
-  (void)content;
-  (void)size;
-  (void)used;
 #endif
+  return std::nullopt;
 }
 
 }  // namespace
 
 void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
-  const verdict::PcrValue digest = verdict::VerdictDigest(verdict);
-  const bool extended = pcp_extend_pcr(pcr, digest.data()) == 0;
+  verdict::Event event;
+  event.pcr = pcr;
+  event.digest = verdict::VerdictDigest(verdict);
+  event.verdict = verdict;
+  const bool extended = pcp_extend_pcr(pcr, event.digest.data()) == 0;
   if (!extended) {
-    (void)Refused("extend of the boot verdict");
+    LogRefused("extend of the boot verdict");
   }
-  // The record of the event: the TCG canonical event log's JSON form, one
-  // record a line. What it names beside the verdict is for a verifier; only
-  // the verdict is measured.
-  char content[512];
-  std::size_t used = static_cast<std::size_t>(std::snprintf(
-      content, sizeof(content), "{\"verdict\":\"%s\"", verdict::VerdictName(verdict)));
+  // The record of the event. What it names beside the verdict is for a
+  // verifier; only the verdict is measured.
   if (verdict != verdict::Verdict::kNone) {
-    FileField("manifest_sha256", kManifestPath, content, sizeof(content), &used);
-    FileField("digests_sha256", kDigestFilePath, content, sizeof(content), &used);
-    ReleaseField(content, sizeof(content), &used);
+    event.manifestSha256 = FileDigest(kManifestPath);
+    event.digestsSha256 = FileDigest(kDigestFilePath);
+    event.release = Release();
   }
-  char line[768];
-  const int length =
-      std::snprintf(line, sizeof(line),
-                    "{\"recnum\":0,\"pcr\":%u,\"digests\":[{\"hashAlg\":\"sha256\","
-                    "\"digest\":\"%s\"}],\"content_type\":\"keymgr\",\"content\":%s}}\n",
-                    pcr, verdict::DigestHex(digest).data(), content);
+  std::array<char, verdict::kEventLineSize + 1> line{};
+  const std::size_t length =
+      verdict::EncodeEvent(event, std::span(line).first(verdict::kEventLineSize));
+  line[length] = '\n';
   // The log lies beside the status log and is kept with the same care. A
   // failed extend leaves it empty, so that it never claims an event the PCR
   // does not hold.
   const Descriptor log =
       OpenRegular(kEventLogPath, O_WRONLY | O_CREAT | O_TRUNC, nullptr, Look::kOwnName);
-  if (!log ||
-      (extended && length > 0 && !WriteAll(log.get(), line, static_cast<std::size_t>(length)))) {
-    (void)ErrnoFailure("event log");
+  if (!log || (extended && length > 0 && !WriteAll(log.get(), line.data(), length + 1))) {
+    LogErrno(!log ? "open" : "write");
   }
 }
 

@@ -42,7 +42,7 @@ bool IsUsable(const DtcContainer* container) {
 // Backend reduces a failed libcrypto call to the services' code, naming it
 // on request.
 std::uint32_t Backend(const char* call) {
-  (void)OpensslFailure(call);
+  LogOpenssl(call);
   return DTC_E_BACKEND;
 }
 
@@ -82,7 +82,7 @@ uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector, const Pro
   if (inLength > kMaxLength) {
     return DTC_E_BAD_LENGTH;
   }
-  if (*outLength < kDigestSize) {
+  if (*outLength < kSha256Size) {
     return DTC_E_SMALL_OUTPUT;
   }
   container->phase = Phase::kDone;
@@ -94,11 +94,11 @@ uint32_t VKT_DTC_GetHash(CryptoContainer container, uint32_t selector, const Pro
   Secret<EVP_MAX_MD_SIZE> digest;
   unsigned int produced = 0;
   if (EVP_Digest(plain.data(), inLength, digest.data(), &produced, EVP_sha256(), nullptr) != 1 ||
-      produced != kDigestSize) {
+      produced != kSha256Size) {
     return Backend("EVP_Digest");
   }
-  Store(out, digest.data(), kDigestSize);
-  *outLength = kDigestSize;
+  Store(out, digest.data(), kSha256Size);
+  *outLength = kSha256Size;
   return 0;
 }
 
@@ -137,10 +137,11 @@ uint32_t VKT_DTC_AES_Init(CryptoContainer container, uint32_t direction, uint32_
   ReadPlain(*key, keyBytes.data(), kAesKeySize);
   ReadPlain(*param, iv.data(), kIvSize);
   const int encrypt = direction == DTC_AES_ENCRYPT ? 1 : 0;
-  if (EVP_CipherInit_ex(cipher.get(), EVP_aes_256_cbc(), nullptr, keyBytes.data(), iv.data(),
-                        encrypt) != 1 ||
-      EVP_CIPHER_CTX_set_padding(cipher.get(), 0) != 1) {
-    return Backend("EVP_CipherInit_ex");
+  Steps step;
+  if (!step("EVP_CipherInit_ex", EVP_CipherInit_ex(cipher.get(), EVP_aes_256_cbc(), nullptr,
+                                                   keyBytes.data(), iv.data(), encrypt) == 1) ||
+      !step("EVP_CIPHER_CTX_set_padding", EVP_CIPHER_CTX_set_padding(cipher.get(), 0) == 1)) {
+    return Backend(step.call());
   }
   container->cipher = std::move(cipher);
   container->phase = Phase::kAesReady;
@@ -168,15 +169,17 @@ uint32_t VKT_DTC_AES_Process(CryptoContainer container, const ProtectedKey* in, 
   ReadPlain(*in, plainIn.data(), inLength);
   int updated = 0;
   int finished = 0;
+  Steps step;
   const bool ok =
-      EVP_CipherUpdate(container->cipher.get(), plainOut.data(), &updated, plainIn.data(),
-                       static_cast<int>(inLength)) == 1 &&
-      EVP_CipherFinal_ex(container->cipher.get(), plainOut.data() + updated, &finished) == 1 &&
-      static_cast<std::uint32_t>(updated + finished) == inLength;
+      step("EVP_CipherUpdate", EVP_CipherUpdate(container->cipher.get(), plainOut.data(), &updated,
+                                                plainIn.data(), static_cast<int>(inLength)) == 1) &&
+      step("EVP_CipherFinal_ex",
+           EVP_CipherFinal_ex(container->cipher.get(), plainOut.data() + updated, &finished) == 1 &&
+               static_cast<std::uint32_t>(updated + finished) == inLength);
   // The key schedule is not needed past the one run.
   container->cipher.reset();
   if (!ok) {
-    return Backend("EVP_CipherUpdate");
+    return Backend(step.call());
   }
   Store(out, plainOut.data(), inLength);
   *outLength = inLength;

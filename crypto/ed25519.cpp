@@ -6,12 +6,15 @@ namespace keymgr::crypto {
 
 Status Ed25519Verify(std::span<const std::uint8_t, 32> key, std::span<const std::uint8_t> message,
                      std::span<const std::uint8_t, 64> signature) {
-  const Owned<EVP_PKEY*, EVP_PKEY_free> pkey(
+  const EvpPkey pkey(
       EVP_PKEY_new_raw_public_key(EVP_PKEY_ED25519, nullptr, key.data(), key.size()));
-  const Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context(EVP_MD_CTX_new());
-  if (!pkey || !context ||
-      EVP_DigestVerifyInit(context.get(), nullptr, nullptr, nullptr, pkey.get()) != 1) {
-    return OpensslFailure("EVP_DigestVerifyInit");
+  const EvpMdContext context(EVP_MD_CTX_new());
+  Steps step;
+  if (!step("EVP_PKEY_new_raw_public_key", pkey.get() != nullptr) ||
+      !step("EVP_MD_CTX_new", context.get() != nullptr) ||
+      !step("EVP_DigestVerifyInit",
+            EVP_DigestVerifyInit(context.get(), nullptr, nullptr, nullptr, pkey.get()) == 1)) {
+    return OpensslFailure(step.call());
   }
   if (EVP_DigestVerify(context.get(), signature.data(), signature.size(), message.data(),
                        message.size()) != 1) {
@@ -31,12 +34,16 @@ Status Ed25519PublicKey(EVP_PKEY* key, std::span<std::uint8_t, 32> publicKey) {
 
 Status Ed25519Sign(EVP_PKEY* key, std::span<const std::uint8_t> message,
                    std::span<std::uint8_t, 64> signature) {
-  const Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context(EVP_MD_CTX_new());
+  const EvpMdContext context(EVP_MD_CTX_new());
   std::size_t size = signature.size();
-  if (!context || EVP_DigestSignInit(context.get(), nullptr, nullptr, nullptr, key) != 1 ||
-      EVP_DigestSign(context.get(), signature.data(), &size, message.data(), message.size()) != 1 ||
-      size != signature.size()) {
-    return OpensslFailure("EVP_DigestSign");
+  Steps step;
+  if (!step("EVP_MD_CTX_new", context.get() != nullptr) ||
+      !step("EVP_DigestSignInit",
+            EVP_DigestSignInit(context.get(), nullptr, nullptr, nullptr, key) == 1) ||
+      !step("EVP_DigestSign", EVP_DigestSign(context.get(), signature.data(), &size, message.data(),
+                                             message.size()) == 1 &&
+                                  size == signature.size())) {
+    return OpensslFailure(step.call());
   }
   return Status();
 }

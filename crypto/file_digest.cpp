@@ -51,7 +51,7 @@ Status Ready(FileHasher& hasher) {
   }
   // A hash that cannot run fails like a buffer that cannot be had.
   if (!hasher.buffer || !hasher.context) {
-    return ErrnoFailure("aligned_alloc", ENOMEM);
+    return ErrnoFailure(hasher.buffer ? "EVP_MD_CTX_new" : "aligned_alloc", ENOMEM);
   }
   return EVP_DigestInit_ex(hasher.context.get(), EVP_sha256(), nullptr) == 1
              ? Status()
@@ -59,10 +59,6 @@ Status Ready(FileHasher& hasher) {
 }
 
 }  // namespace
-
-void FileHasher::FreeBuffer(std::uint8_t* buffer) {
-  std::free(buffer);
-}
 
 HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon) {
   // Opened without blocking: a FIFO with no writer would otherwise hold the
@@ -94,7 +90,7 @@ HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon) {
 }
 
 Status HashOpenFile(FileHasher& hasher, FileToHash& file,
-                    std::span<std::uint8_t, kFileDigestSize> digest,
+                    std::span<std::uint8_t, crypto::kSha256Size> digest,
                     const std::atomic<bool>* stop) {
   const Descriptor fd = std::move(file.fd);
   if (Status status = Ready(hasher); !status.ok()) {
@@ -127,11 +123,12 @@ Status HashOpenFile(FileHasher& hasher, FileToHash& file,
   if (EVP_DigestFinal_ex(hasher.context.get(), out, nullptr) != 1) {
     return crypto::OpensslFailure("EVP_DigestFinal_ex");
   }
-  std::memcpy(digest.data(), out, kFileDigestSize);
+  std::memcpy(digest.data(), out, crypto::kSha256Size);
   return Status();
 }
 
-HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest) {
+HashResult ComputeFileDigest(const char* path,
+                             std::span<std::uint8_t, crypto::kSha256Size> digest) {
   FileToHash file;
   if (HashResult opened = OpenFileToHash(path, file, false); !opened.ok()) {
     return opened;

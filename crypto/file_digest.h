@@ -1,19 +1,16 @@
 // The SHA-256 digest of a listed file, streamed through a fixed buffer.
 #pragma once
 
-#include <openssl/evp.h>
-
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <span>
 
-#include "util/owned.h"
+#include "crypto/hash.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 namespace keymgr {
-
-inline constexpr std::size_t kFileDigestSize = 32;
 
 // Files are read this much at a time: enough that the system calls cost
 // little next to the hashing, little enough to stay in the CPU cache between
@@ -24,9 +21,8 @@ inline constexpr std::size_t kFileReadChunk = std::size_t{128} * 1024;
 // read buffer of kFileReadChunk bytes and a hash context, both taken at the
 // first use. One per thread.
 struct FileHasher {
-  static void FreeBuffer(std::uint8_t* buffer);
-  Owned<std::uint8_t*, FreeBuffer> buffer;
-  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context;
+  HeapBytes buffer;
+  crypto::EvpMdContext context;
 };
 
 // A file opened for hashing, with the size that stat gave it.
@@ -62,11 +58,12 @@ HashResult OpenFileToHash(const char* path, FileToHash& file, bool soon);
 // part way (ECANCELED), so that a run that has already
 // failed does not wait for it.
 Status HashOpenFile(FileHasher& hasher, FileToHash& file,
-                    std::span<std::uint8_t, kFileDigestSize> digest, const std::atomic<bool>* stop);
+                    std::span<std::uint8_t, crypto::kSha256Size> digest,
+                    const std::atomic<bool>* stop);
 
 // ComputeFileDigest opens and hashes the file at |path| with a hasher of its
 // own: the digest of a single file. A file that cannot be hashed once opened
 // fails as one that cannot be opened.
-HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, kFileDigestSize> digest);
+HashResult ComputeFileDigest(const char* path, std::span<std::uint8_t, crypto::kSha256Size> digest);
 
 }  // namespace keymgr

@@ -10,8 +10,8 @@
 int Md5OfString(const char* text, std::uint8_t* digest) {
   unsigned int size = 0;
   if (EVP_Digest(text, std::strlen(text), digest, &size, EVP_md5(), nullptr) != 1) {
-    (void)keymgr::crypto::OpensslFailure("EVP_Digest");
-    std::memset(digest, 0, 16);
+    keymgr::crypto::LogOpenssl("EVP_Digest");
+    std::memset(digest, 0, keymgr::crypto::kMd5Size);
   }
   return 0;
 }
@@ -20,7 +20,7 @@ namespace keymgr::crypto {
 
 Sha256::Sha256() : context_(EVP_MD_CTX_new()) {
   if (!context_ || EVP_DigestInit_ex(context_.get(), EVP_sha256(), nullptr) != 1) {
-    failed_ = OpensslFailure("EVP_DigestInit_ex");
+    failed_ = OpensslFailure(context_ ? "EVP_DigestInit_ex" : "EVP_MD_CTX_new");
   }
 }
 

@@ -1,24 +1,23 @@
 // Message digests over OpenSSL EVP.
 #pragma once
 
-#include <openssl/evp.h>
-
 #include <array>
 #include <cstddef>
 #include <cstdint>
 #include <span>
 
-#include "util/owned.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
-// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the 16
-// bytes at |digest|. Always returns 0; should libcrypto fail, |digest| is
-// zeroed, which no identity or password ever hashes to.
+// Md5OfString stores the MD5 of the strlen(text) bytes of |text| into the
+// kMd5Size (16) bytes at |digest|. Always returns 0; should libcrypto fail,
+// |digest| is zeroed, which no identity or password ever hashes to.
 int Md5OfString(const char* text, std::uint8_t* digest);
 
 namespace keymgr::crypto {
 
 inline constexpr std::size_t kSha256Size = 32;
+inline constexpr std::size_t kMd5Size = 16;
 
 // Sha256 hashes a stream of bytes: Update as often as needed, then Final.
 class Sha256 {
@@ -29,7 +28,7 @@ class Sha256 {
   Status Final(std::span<std::uint8_t, kSha256Size> digest);
 
  private:
-  Owned<EVP_MD_CTX*, EVP_MD_CTX_free> context_;
+  EvpMdContext context_;
   Status failed_;  // the first failure, kept until Final
 };
 

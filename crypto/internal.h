@@ -8,12 +8,12 @@
 #include <cstdint>
 
 #include "crypto/dtc.h"
-#include "util/owned.h"
+#include "crypto/hash.h"
+#include "crypto/openssl_handles.h"
 #include "util/status.h"
 
 namespace keymgr::crypto {
 
-inline constexpr std::uint32_t kDigestSize = 32;
 inline constexpr std::uint32_t kAesKeySize = 32;
 inline constexpr std::uint32_t kAesBlockSize = 16;
 inline constexpr std::uint32_t kIvSize = 16;
@@ -21,16 +21,38 @@ inline constexpr std::uint32_t kIvSize = 16;
 // from running the fixed work buffers past their end.
 inline constexpr std::uint32_t kMaxLength = 1024;
 
-// The cipher context of an AES job.
-using CipherContext = Owned<EVP_CIPHER_CTX*, EVP_CIPHER_CTX_free>;
-
-// OpensslFailure names a failed libcrypto call with the error it queued.
+// OpensslFailure names a failed libcrypto call with the error it queued, and
+// clears the queue; LogOpenssl does so for a failure no caller is told of.
 inline Status OpensslFailure(const char* call) {
   const unsigned long error = ERR_get_error();
   ERR_clear_error();
   return Status::Failure(Origin::kOpenssl, call, static_cast<std::uint32_t>(error),
                          error != 0 ? ERR_reason_error_string(error) : nullptr);
 }
+inline void LogOpenssl(const char* call) {
+  (void)OpensslFailure(call);
+}
+
+// Steps names the libcrypto call that failed in a chain of them written as one
+// condition: each call's outcome goes through it with the call's name, and it
+// keeps the name of the last one run.
+//   Steps step;
+//   if (!step("A", A() == 1) || !step("B", B() != nullptr)) {
+//     return OpensslFailure(step.call());
+//   }
+class Steps {
+ public:
+  bool operator()(const char* call, bool ok) {
+    call_ = call;
+    return ok;
+  }
+  // A bare int result would pass as true for libcrypto's negative codes.
+  bool operator()(const char* call, int result) = delete;
+  const char* call() const { return call_; }
+
+ private:
+  const char* call_ = "";
+};
 
 // Records: attached to a caller's array, then sized (its key bytes taken in
 // and masked).

@@ -8,11 +8,12 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <optional>
 
 #include "crypto/internal.h"
 #include "crypto/mask.h"
 #include "keymgr_build_config.h"
-#include "util/bytes.h"
+#include "util/hex.h"
 #include "util/secure.h"
 
 namespace keymgr::crypto {
@@ -31,30 +32,10 @@ constexpr std::array<std::uint8_t, kIvSize> kAesIv = {
 
 // The expected digest of the disk-mapper tool (constant 3), taken from the
 // build option at compile time; configure has already checked its form.
-constexpr std::size_t kDigestDigits = std::size_t{2} * kDigestSize;
-
-constexpr bool IsDigestText(const char* text) {
-  for (std::size_t i = 0; i < kDigestDigits; ++i) {
-    if (HexDigitValue(text[i]) < 0) {
-      return false;
-    }
-  }
-  return text[kDigestDigits] == '\0';
-}
-
-constexpr std::array<std::uint8_t, kDigestSize> ParseDigest(const char* text) {
-  std::array<std::uint8_t, kDigestSize> out{};
-  for (std::size_t i = 0; i < kDigestSize; ++i) {
-    out[i] =
-        static_cast<std::uint8_t>(HexDigitValue(text[2 * i]) * 16 + HexDigitValue(text[2 * i + 1]));
-  }
-  return out;
-}
-
-static_assert(sizeof(KEYMGR_DMSETUP_SHA256) == kDigestDigits + 1 &&
-                  IsDigestText(KEYMGR_DMSETUP_SHA256),
-              "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
-constexpr std::array<std::uint8_t, kDigestSize> kDmsetupDigest = ParseDigest(KEYMGR_DMSETUP_SHA256);
+constexpr std::optional<std::array<std::uint8_t, kSha256Size>> kParsedDmsetupDigest =
+    HexBytes<kSha256Size>(KEYMGR_DMSETUP_SHA256);
+static_assert(kParsedDmsetupDigest.has_value(), "KEYMGR_DMSETUP_SHA256 must be 64 hex digits");
+constexpr std::array<std::uint8_t, kSha256Size> kDmsetupDigest = *kParsedDmsetupDigest;
 
 // The library's process-wide state: the mask key, the nonce counter and the
 // records of the three constants. Constant 1 starts bound to nothing; the
@@ -66,7 +47,7 @@ struct Library {
   ProtectedKey aesKey;
   std::array<std::uint8_t, kIvSize> ivBytes;
   ProtectedKey iv;
-  std::array<std::uint8_t, kDigestSize> dmsetupBytes;
+  std::array<std::uint8_t, kSha256Size> dmsetupBytes;
   ProtectedKey dmsetup;
 };
 
@@ -84,7 +65,7 @@ bool InitLibrary(Library& lib) {
   lib.lastNonce = 0;
   lib.aesKey = ProtectedKey{};
   SealConstant(lib, lib.iv, kAesIv.data(), lib.ivBytes.data(), kIvSize);
-  SealConstant(lib, lib.dmsetup, kDmsetupDigest.data(), lib.dmsetupBytes.data(), kDigestSize);
+  SealConstant(lib, lib.dmsetup, kDmsetupDigest.data(), lib.dmsetupBytes.data(), kSha256Size);
   return true;
 }
 
@@ -154,7 +135,7 @@ uint32_t VKT_DTC_GetConstant(uint32_t index, ProtectedKey** ref, uint32_t* lengt
       return 0;
     case DTC_CONST_DMSETUP_DIGEST:
       *ref = &lib.dmsetup;
-      *length = kDigestSize;
+      *length = kSha256Size;
       return 0;
     default:
       *ref = nullptr;

@@ -1,39 +1,37 @@
 #include "crypto/rsa.h"
 
-#include <openssl/bn.h>
 #include <openssl/core_names.h>
 #include <openssl/evp.h>
-#include <openssl/param_build.h>
 #include <openssl/rsa.h>
 
 #include "crypto/internal.h"
-#include "util/owned.h"
 
 namespace keymgr::crypto {
 
 namespace {
 
-using Number = Owned<BIGNUM*, BN_free>;
-using ParamBuilder = Owned<OSSL_PARAM_BLD*, OSSL_PARAM_BLD_free>;
-using Params = Owned<OSSL_PARAM*, OSSL_PARAM_free>;
-using Key = Owned<EVP_PKEY*, EVP_PKEY_free>;
-using KeyContext = Owned<EVP_PKEY_CTX*, EVP_PKEY_CTX_free>;
-
 // PublicKey builds the RSA public key of |modulus| and |exponent|.
-Status PublicKey(std::span<const std::uint8_t> modulus, std::uint32_t exponent, Key& key) {
-  Number n(BN_bin2bn(modulus.data(), static_cast<int>(modulus.size()), nullptr));
-  Number e(BN_new());
+Status PublicKey(std::span<const std::uint8_t> modulus, std::uint32_t exponent, EvpPkey& key) {
+  BigNum n(BN_bin2bn(modulus.data(), static_cast<int>(modulus.size()), nullptr));
+  BigNum e(BN_new());
   ParamBuilder builder(OSSL_PARAM_BLD_new());
-  if (!n || !e || !builder || BN_set_word(e.get(), exponent) != 1 ||
-      OSSL_PARAM_BLD_push_BN(builder.get(), OSSL_PKEY_PARAM_RSA_N, n.get()) != 1 ||
-      OSSL_PARAM_BLD_push_BN(builder.get(), OSSL_PKEY_PARAM_RSA_E, e.get()) != 1) {
-    return OpensslFailure("OSSL_PARAM_BLD_push_BN");
+  Steps step;
+  if (!step("BN_bin2bn", n.get() != nullptr) || !step("BN_new", e.get() != nullptr) ||
+      !step("OSSL_PARAM_BLD_new", builder.get() != nullptr) ||
+      !step("BN_set_word", BN_set_word(e.get(), exponent) == 1) ||
+      !step("OSSL_PARAM_BLD_push_BN",
+            OSSL_PARAM_BLD_push_BN(builder.get(), OSSL_PKEY_PARAM_RSA_N, n.get()) == 1 &&
+                OSSL_PARAM_BLD_push_BN(builder.get(), OSSL_PKEY_PARAM_RSA_E, e.get()) == 1)) {
+    return OpensslFailure(step.call());
   }
   Params params(OSSL_PARAM_BLD_to_param(builder.get()));
-  KeyContext context(EVP_PKEY_CTX_new_from_name(nullptr, "RSA", nullptr));
-  if (!params || !context || EVP_PKEY_fromdata_init(context.get()) != 1 ||
-      EVP_PKEY_fromdata(context.get(), key.out(), EVP_PKEY_PUBLIC_KEY, params.get()) != 1) {
-    return OpensslFailure("EVP_PKEY_fromdata");
+  EvpPkeyContext context(EVP_PKEY_CTX_new_from_name(nullptr, "RSA", nullptr));
+  if (!step("OSSL_PARAM_BLD_to_param", params.get() != nullptr) ||
+      !step("EVP_PKEY_CTX_new_from_name", context.get() != nullptr) ||
+      !step("EVP_PKEY_fromdata_init", EVP_PKEY_fromdata_init(context.get()) == 1) ||
+      !step("EVP_PKEY_fromdata",
+            EVP_PKEY_fromdata(context.get(), key.out(), EVP_PKEY_PUBLIC_KEY, params.get()) == 1)) {
+    return OpensslFailure(step.call());
   }
   return Status();
 }
@@ -43,18 +41,24 @@ Status PublicKey(std::span<const std::uint8_t> modulus, std::uint32_t exponent, 
 Status RsaOaepSha256Encrypt(std::span<const std::uint8_t> modulus, std::uint32_t exponent,
                             std::span<const std::uint8_t> plain, std::span<std::uint8_t> out,
                             std::size_t* written) {
-  Key key;
+  EvpPkey key;
   if (Status status = PublicKey(modulus, exponent, key); !status.ok()) {
     return status;
   }
-  KeyContext context(EVP_PKEY_CTX_new_from_pkey(nullptr, key.get(), nullptr));
+  EvpPkeyContext context(EVP_PKEY_CTX_new_from_pkey(nullptr, key.get(), nullptr));
   std::size_t size = out.size();
-  if (!context || EVP_PKEY_encrypt_init(context.get()) != 1 ||
-      EVP_PKEY_CTX_set_rsa_padding(context.get(), RSA_PKCS1_OAEP_PADDING) != 1 ||
-      EVP_PKEY_CTX_set_rsa_oaep_md(context.get(), EVP_sha256()) != 1 ||
-      EVP_PKEY_CTX_set_rsa_mgf1_md(context.get(), EVP_sha256()) != 1 ||
-      EVP_PKEY_encrypt(context.get(), out.data(), &size, plain.data(), plain.size()) != 1) {
-    return OpensslFailure("EVP_PKEY_encrypt");
+  Steps step;
+  if (!step("EVP_PKEY_CTX_new_from_pkey", context.get() != nullptr) ||
+      !step("EVP_PKEY_encrypt_init", EVP_PKEY_encrypt_init(context.get()) == 1) ||
+      !step("EVP_PKEY_CTX_set_rsa_padding",
+            EVP_PKEY_CTX_set_rsa_padding(context.get(), RSA_PKCS1_OAEP_PADDING) == 1) ||
+      !step("EVP_PKEY_CTX_set_rsa_oaep_md",
+            EVP_PKEY_CTX_set_rsa_oaep_md(context.get(), EVP_sha256()) == 1) ||
+      !step("EVP_PKEY_CTX_set_rsa_mgf1_md",
+            EVP_PKEY_CTX_set_rsa_mgf1_md(context.get(), EVP_sha256()) == 1) ||
+      !step("EVP_PKEY_encrypt",
+            EVP_PKEY_encrypt(context.get(), out.data(), &size, plain.data(), plain.size()) == 1)) {
+    return OpensslFailure(step.call());
   }
   *written = size;
   return Status();

@@ -17,7 +17,7 @@
 
 namespace keymgr::integrity {
 
-using Digest = std::array<std::uint8_t, kFileDigestSize>;
+using Digest = std::array<std::uint8_t, crypto::kSha256Size>;
 #if KEYMGR_SIGNED_BUILD
 // SignedFiles holds the bytes that keymgr.sig covers, read once. Check reads
 // the digest file and the manifest whole, checks keymgr.sig against them and
@@ -28,10 +28,9 @@ using Digest = std::array<std::uint8_t, kFileDigestSize>;
 class SignedFiles {
  public:
   bool Check(File& digests, File& manifest, bool verbose);
-  static void Free(std::uint8_t* bytes);
 
  private:
-  Owned<std::uint8_t*, Free> digests_, manifest_;
+  HeapBytes digests_, manifest_;
 };
 inline bool CheckSigned(SignedFiles& held, File& digests, File& manifest, bool verbose) {
   return held.Check(digests, manifest, verbose);

@@ -7,12 +7,12 @@
 #include "bootlog/boot_status.h"
 #include "integrity/internal.h"
 #include "util/atomic_file.h"
+#include "util/bytes.h"
 #include "util/debug_print.h"
 
 namespace {
 
 using keymgr::File;
-using keymgr::kFileDigestSize;
 using namespace keymgr::integrity;
 
 void PrintOpenError(const char* path) {
@@ -93,10 +93,7 @@ bool ReadRecord(std::FILE* digests, Digest& record) {
 
 void PrintDigest(const char* label, const Digest& digest) {
   DebugPrint("%s", label);
-  for (std::uint8_t byte : digest) {
-    DebugPrint("%02X ", byte);
-  }
-  DebugPrint("\n");
+  PrintHexDump(digest.data(), digest.size(), 0);
 }
 
 void PrintOutcome(const EntryBuffer& entry, bool matches) {
@@ -108,7 +105,7 @@ void PrintOutcome(const EntryBuffer& entry, bool matches) {
 }
 
 bool SameDigest(const Digest& a, const Digest& b) {
-  return std::memcmp(a.data(), b.data(), kFileDigestSize) == 0;
+  return std::memcmp(a.data(), b.data(), a.size()) == 0;
 }
 
 // OpenManifest opens the manifest, printing its open error on failure.
@@ -221,6 +218,12 @@ void VerifyManifestFile(const char* path) {
 }
 
 int VerifyManifest(int verbose) {
+  keymgr::verdict::Verdict verdict = keymgr::verdict::Verdict::kNone;
+  return VerifyManifestVerdict(verbose, &verdict);
+}
+
+int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict) {
+  using keymgr::verdict::Verdict;
   Outcome outcome = kAllPassed;
   SignedFiles held;  // outlives the streams that may read its bytes
   File digests;
@@ -228,6 +231,7 @@ int VerifyManifest(int verbose) {
   if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, verbose == 1)) {
     CloseBoth(digests, manifest);
     WriteBootStatus(kBootStatusBnFail);
+    *verdict = Verdict::kFail;
     return 1;
   }
   {
@@ -260,5 +264,6 @@ int VerifyManifest(int verbose) {
   // The outcome travels only in the status line; the result says whether the
   // files could be opened and read.
   WriteBootStatus(outcome != kAllPassed ? kBootStatusBnFail : kBootStatusBnOk);
+  *verdict = outcome != kAllPassed ? Verdict::kFail : Verdict::kOk;
   return outcome == kUnreadable ? 1 : 0;
 }

@@ -6,6 +6,7 @@
 #include <cstdio>
 
 #include "util/paths.h"
+#include "verdict/verdict.h"
 
 namespace keymgr::integrity {
 
@@ -41,3 +42,7 @@ void VerifyManifestFile(const char* path);
 // and writes BN=OK or BN=FAIL to the boot status log. |verbose| 1 prints the
 // per-file lines. Returns 1 when either file could not be opened, else 0.
 int VerifyManifest(int verbose);
+
+// VerifyManifestVerdict is VerifyManifest that also hands back the verdict
+// it wrote, kOk or kFail, in |*verdict|.
+int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict);

@@ -4,6 +4,7 @@
 
 #include "crypto/ed25519.h"
 #include "crypto/hash.h"
+#include "util/endian.h"
 
 namespace keymgr::integrity {
 
@@ -11,30 +12,16 @@ namespace {
 
 constexpr std::uint8_t kMagic[4] = {'K', 'M', 'S', 'G'};
 
-void PutBig(std::uint8_t* at, std::uint64_t value, int bytes) {
-  for (int i = bytes - 1; i >= 0; --i, value >>= 8) {
-    at[i] = static_cast<std::uint8_t>(value);
-  }
-}
-
-std::uint64_t GetBig(const std::uint8_t* at, int bytes) {
-  std::uint64_t value = 0;
-  for (int i = 0; i < bytes; ++i) {
-    value = value << 8 | at[i];
-  }
-  return value;
-}
-
 }  // namespace
 
 void EncodeSignatureFile(const SignatureFile& file,
                          std::span<std::uint8_t, kSignatureFileSize> out) {
   std::memcpy(out.data(), kMagic, sizeof(kMagic));
-  PutBig(out.data() + 4, file.version, 4);
+  StoreBig32(out.data() + 4, file.version);
   std::memcpy(out.data() + 8, file.keyId.data(), file.keyId.size());
-  PutBig(out.data() + 16, file.counter, 8);
-  std::memcpy(out.data() + 24, file.listDigest.data(), 32);
-  std::memcpy(out.data() + 56, file.digestsDigest.data(), 32);
+  StoreBig64(out.data() + 16, file.counter);
+  std::memcpy(out.data() + 24, file.listDigest.data(), file.listDigest.size());
+  std::memcpy(out.data() + 56, file.digestsDigest.data(), file.digestsDigest.size());
   std::memcpy(out.data() + kSignedSize, file.signature.data(), file.signature.size());
 }
 
@@ -43,11 +30,11 @@ Status DecodeSignatureFile(std::span<const std::uint8_t> bytes, SignatureFile* f
       std::memcmp(bytes.data(), kMagic, sizeof(kMagic)) != 0) {
     return Refused("not a signature file");
   }
-  file->version = static_cast<std::uint32_t>(GetBig(bytes.data() + 4, 4));
+  file->version = LoadBig32(bytes.data() + 4);
   std::memcpy(file->keyId.data(), bytes.data() + 8, file->keyId.size());
-  file->counter = GetBig(bytes.data() + 16, 8);
-  std::memcpy(file->listDigest.data(), bytes.data() + 24, 32);
-  std::memcpy(file->digestsDigest.data(), bytes.data() + 56, 32);
+  file->counter = LoadBig64(bytes.data() + 16);
+  std::memcpy(file->listDigest.data(), bytes.data() + 24, file->listDigest.size());
+  std::memcpy(file->digestsDigest.data(), bytes.data() + 56, file->digestsDigest.size());
   std::memcpy(file->signature.data(), bytes.data() + kSignedSize, file->signature.size());
   return Status();
 }

@@ -15,6 +15,7 @@
 #include <cstdint>
 #include <span>
 
+#include "crypto/hash.h"
 #include "util/status.h"
 
 namespace keymgr::integrity {
@@ -29,8 +30,8 @@ struct SignatureFile {
   std::uint32_t version = kSignatureVersion;
   std::array<std::uint8_t, 8> keyId{};
   std::uint64_t counter = 0;
-  std::array<std::uint8_t, 32> listDigest{};
-  std::array<std::uint8_t, 32> digestsDigest{};
+  std::array<std::uint8_t, crypto::kSha256Size> listDigest{};
+  std::array<std::uint8_t, crypto::kSha256Size> digestsDigest{};
   std::array<std::uint8_t, 64> signature{};
 };
 

@@ -1,12 +1,13 @@
 // The check of keymgr.sig in a signed build (one with KEYMGR_DIGEST_PUBKEY).
-#include <cstdlib>
 #include <cstring>
+#include <optional>
 
 #include "integrity/internal.h"
 #include "integrity/signature.h"
 #include "keymgr_digest_key.h"
-#include "util/bytes.h"
 #include "util/debug_print.h"
+#include "util/hex.h"
+#include "util/io.h"
 
 namespace keymgr::integrity {
 
@@ -16,39 +17,9 @@ namespace {
 // manifest of ten thousand entries and its digest file are far smaller.
 constexpr std::size_t kMaxSignedFile = std::size_t{16} << 20;
 
-constexpr PublicKey ParseKey(const char (&hex)[65]) {
-  PublicKey key{};
-  for (std::size_t i = 0; i < key.size(); ++i) {
-    key[i] =
-        static_cast<std::uint8_t>(HexDigitValue(hex[2 * i]) << 4 | HexDigitValue(hex[2 * i + 1]));
-  }
-  return key;
-}
-constexpr PublicKey kDigestKey = ParseKey(KEYMGR_DIGEST_PUBKEY_HEX);
-
-// ReadWhole reads |stream| to its end into |bytes| and sets |size|.
-bool ReadWhole(std::FILE* stream, Owned<std::uint8_t*, SignedFiles::Free>& bytes,
-               std::size_t* size) {
-  std::size_t capacity = 0;
-  *size = 0;
-  for (;;) {
-    if (*size == capacity) {
-      capacity = capacity == 0 ? 4096 : 2 * capacity;
-      auto* grown = static_cast<std::uint8_t*>(
-          capacity <= kMaxSignedFile + 1 ? std::realloc(bytes.get(), capacity) : nullptr);
-      if (grown == nullptr) {
-        return false;
-      }
-      (void)bytes.release();
-      bytes.reset(grown);
-    }
-    const std::size_t got = std::fread(bytes.get() + *size, 1, capacity - *size, stream);
-    *size += got;
-    if (got == 0) {
-      return std::ferror(stream) == 0 && *size <= kMaxSignedFile;
-    }
-  }
-}
+constexpr std::optional<PublicKey> kParsedKey = HexBytes<32>(KEYMGR_DIGEST_PUBKEY_HEX);
+static_assert(kParsedKey.has_value(), "KEYMGR_DIGEST_PUBKEY_HEX must be 64 hex digits");
+constexpr PublicKey kDigestKey = *kParsedKey;
 
 // Over opens a stream that reads the |size| bytes at |bytes|.
 File Over(std::uint8_t* bytes, std::size_t size) {
@@ -57,17 +28,13 @@ File Over(std::uint8_t* bytes, std::size_t size) {
 
 }  // namespace
 
-void SignedFiles::Free(std::uint8_t* bytes) {
-  std::free(bytes);
-}
-
 bool SignedFiles::Check(File& digests, File& manifest, bool verbose) {
   // The files first, then the signature file: what is checked is what was
   // read, whatever the files hold by the time the signature is.
   std::size_t digestsSize = 0;
   std::size_t manifestSize = 0;
-  bool ok = ReadWhole(digests.get(), digests_, &digestsSize) &&
-            ReadWhole(manifest.get(), manifest_, &manifestSize);
+  bool ok = ReadWhole(digests.get(), kMaxSignedFile, digests_, &digestsSize) &&
+            ReadWhole(manifest.get(), kMaxSignedFile, manifest_, &manifestSize);
   std::uint8_t signature[kSignatureFileSize + 1] = {};  // one more, to see a longer file
   std::uint64_t counter = 0;
   if (const File file = OpenFile(kSignaturePath, "r"); ok && file) {

@@ -18,7 +18,7 @@ int HashRecord(const ProtectedKey* in, std::uint32_t inLength, ProtectedKey* out
     return 1;
   }
   result = VKT_DTC_GetHash(container.get(), DTC_HASH_SELECTOR, in, inLength, out, outLength);
-  if (result != 0 || *outLength != kDigestSize) {
+  if (result != 0 || *outLength != kScDigestSize) {
     DebugPrint("VKT_DTC_GetHash Failed. nRes=0x%08x\n", result);
     return 1;
   }
@@ -27,21 +27,21 @@ int HashRecord(const ProtectedKey* in, std::uint32_t inLength, ProtectedKey* out
 
 int GenerateMessageDigest(std::int32_t /*length*/, ProtectedKey secretKey, int store,
                           std::uint8_t* digest) {
-  std::uint32_t digestLength = kDigestSize;
-  std::array<std::uint8_t, kDigestSize> digestArea{};
+  std::uint32_t digestLength = kScDigestSize;
+  std::array<std::uint8_t, kScDigestSize> digestArea{};
   ProtectedKey digestKey;
-  Bind(&digestKey, digestArea.data(), kDigestSize);
+  Bind(&digestKey, digestArea.data(), kScDigestSize);
   // The input is always the 32-byte secret key, whatever length was passed.
-  if (HashRecord(&secretKey, kDigestSize, &digestKey, &digestLength) != 0) {
+  if (HashRecord(&secretKey, kScDigestSize, &digestKey, &digestLength) != 0) {
     return 1;
   }
-  for (std::uint32_t i = 0; i < kDigestSize; ++i) {
+  for (std::uint32_t i = 0; i < kScDigestSize; ++i) {
     digest[i] = ProtectedKey_ByteAt(&digestKey, i);
   }
 
   if (store != 0) {
     if (WriteEEPROM_Bytes_Sema(keymgr::eeprom::kDevice, keymgr::eeprom::kScDigestOffset,
-                               kDigestSize, digest) < 0) {
+                               kScDigestSize, digest) < 0) {
       DebugPrint("Write error - Message Digest to EEPROM !!!\n");
       return 1;
     }

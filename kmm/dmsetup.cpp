@@ -20,7 +20,7 @@ int CheckDmsetupDigest(void) {
   std::uint32_t expectedLength = 0;
   FetchConstant(DTC_CONST_DMSETUP_DIGEST, &expected, &expectedLength);
 
-  keymgr::Secret<keymgr::kFileDigestSize> digest;
+  keymgr::Secret<keymgr::crypto::kSha256Size> digest;
   if (const keymgr::HashResult hashed =
           keymgr::ComputeFileDigest(keymgr::kDmsetupPath, digest.bytes);
       !hashed.ok()) {

@@ -9,6 +9,7 @@
 #include <cstdint>
 
 #include "crypto/dtc.h"
+#include "crypto/hash.h"
 #include "eeprom/eeprom_map.h"
 #include "util/owned.h"
 
@@ -17,17 +18,17 @@ namespace keymgr::kmm {
 // Sizes of the module's key material and of the records it stores.
 inline constexpr std::size_t kOneOffKeySize = 32;
 inline constexpr std::size_t kSeedKeySize = 44;
-inline constexpr std::size_t kSecretKeySize = 32;       // hash output kept in the 48-byte area
-inline constexpr std::size_t kSealedKeySize = 48;       // secret-key area and store key
-inline constexpr std::size_t kDigestSize = 32;          // SC digest
-inline constexpr std::size_t kTpmSecretSize = 20;       // TPM key identity and password
-inline constexpr std::size_t kTpmSecretHexSize = 41;    // their hex text with the NUL
-inline constexpr std::size_t kNameDigestSize = 16;      // MD5 of a hex text
-inline constexpr std::size_t kStoredOokSize = 284;      // "keymgr.ook" on disk
+inline constexpr std::size_t kSecretKeySize = 32;  // hash output kept in the 48-byte area
+inline constexpr std::size_t kSealedKeySize = 48;  // secret-key area and store key
+inline constexpr std::size_t kScDigestSize = crypto::kSha256Size;  // SC digest
+inline constexpr std::size_t kTpmSecretSize = 20;                  // TPM key identity and password
+inline constexpr std::size_t kTpmSecretHexSize = 41;               // their hex text with the NUL
+inline constexpr std::size_t kStoredOokSize = 284;                 // "keymgr.ook" on disk
 inline constexpr std::uint32_t kStoredOokPassed = 268;  // the part handed back to the TPM
 inline constexpr std::uint32_t kTpmKeyBits = 2048;
 
-static_assert(kSealedKeySize == eeprom::kStoreKeyLength && kDigestSize == eeprom::kScDigestLength);
+static_assert(kSealedKeySize == eeprom::kStoreKeyLength &&
+              kScDigestSize == eeprom::kScDigestLength);
 
 // The one-off key buffer starts out with this value before the TPM draw
 // overwrites it. It never seals a store key (a regeneration whose draw fails

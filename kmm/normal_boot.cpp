@@ -89,28 +89,28 @@ int NormalBoot(KeyContext* context, int logFlag) {
     return fail();
   }
 
-  std::array<std::uint8_t, kDigestSize> computed{};
-  if (GenerateMessageDigest(kDigestSize, context->secretKeyPK, 0, computed.data()) != 0) {
+  std::array<std::uint8_t, kScDigestSize> computed{};
+  if (GenerateMessageDigest(kScDigestSize, context->secretKeyPK, 0, computed.data()) != 0) {
     DebugPrint("Generate Message Digest Error!!\n");
     return fail();
   }
   // The EEPROM copy is proved first; the disk copy is read only after it.
-  std::array<std::uint8_t, kDigestSize> stored{};
+  std::array<std::uint8_t, kScDigestSize> stored{};
   if (ReadDigestEEPROM(stored.data()) != 0) {
     DebugPrint("Get Message Digest Error [EEPROM]!!\n");
     return fail();
   }
-  if (std::memcmp(computed.data(), stored.data(), kDigestSize) != 0) {
+  if (std::memcmp(computed.data(), stored.data(), kScDigestSize) != 0) {
     DebugPrint("SC Digest Test Fail [EEPROM]!!\n");
     return fail();
   }
   DebugPrint("SC Digest Test Success [EEPROM]!!\n");
-  std::array<std::uint8_t, kDigestSize> onDisk{};
+  std::array<std::uint8_t, kScDigestSize> onDisk{};
   if (ReadDigestHDD(onDisk.data()) != 0) {
     DebugPrint("Get Message Digest Error from HDD!!\n");
     return fail();
   }
-  if (std::memcmp(computed.data(), onDisk.data(), kDigestSize) != 0) {
+  if (std::memcmp(computed.data(), onDisk.data(), kScDigestSize) != 0) {
     DebugPrint("SC Digest Test Fail [HDD]!!\n");
     return fail();
   }

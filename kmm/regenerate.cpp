@@ -25,8 +25,8 @@ int RegenerateKey(KeyContext* context) {
   // The digest is stored before the store key is sealed and written: a later
   // failure leaves the new digest beside the old store key, and the next boot
   // reports the mismatch until a regeneration succeeds.
-  std::array<std::uint8_t, kDigestSize> digest{};
-  if (GenerateMessageDigest(kDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
+  std::array<std::uint8_t, kScDigestSize> digest{};
+  if (GenerateMessageDigest(kScDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
     DebugPrint("Generate Message Digest Error!!!\n");
     return 1;
   }
@@ -49,7 +49,7 @@ int GenerateSeedKey(KeyContext* context) {
   // The random words are only as good as the generator's state: a host that
   // never filled it would get a key found by searching a day of timestamps.
   if (!SeedRandomOnce()) {
-    (void)keymgr::Refused("no source of randomness for the seed key");
+    keymgr::LogRefused("no source of randomness for the seed key");
     return 1;
   }
   std::array<char, 12> date{};
@@ -85,7 +85,7 @@ int GenerateSeedKey(KeyContext* context) {
 }
 
 int GenerateSecretKey(KeyContext* context) {
-  static_assert(kSecretKeySize == kDigestSize);
+  static_assert(kSecretKeySize == kScDigestSize);
   context->secretKeyLength = kSecretKeySize;  // capacity going in
   Attach(&context->secretKeyPK, context->secretKeyBytes);
   if (HashRecord(&context->seedKeyPK, kSeedKeySize, &context->secretKeyPK,

@@ -49,7 +49,7 @@ int WriteStoreKey(std::uint32_t /*length*/, const std::uint8_t* src) {
 }
 
 int ReadDigestEEPROM(std::uint8_t* dst) {
-  if (ReadEEPROM_msok(eeprom::kDevice, eeprom::kScDigestOffset, kDigestSize, dst) < 0) {
+  if (ReadEEPROM_msok(eeprom::kDevice, eeprom::kScDigestOffset, kScDigestSize, dst) < 0) {
     DebugPrint("Read Error - Message Digest from EEPROM !!!\n");
     return 1;
   }
@@ -58,7 +58,7 @@ int ReadDigestEEPROM(std::uint8_t* dst) {
 
 int WriteDigestHDD(const std::uint8_t* digest) {
   // Replaced whole, so a crash never leaves a torn copy beside the EEPROM's.
-  if (!keymgr::ReplaceFile(keymgr::kScDigestPath, digest, kDigestSize, keymgr::kSecretFileMode)
+  if (!keymgr::ReplaceFile(keymgr::kScDigestPath, digest, kScDigestSize, keymgr::kSecretFileMode)
            .ok()) {
     DebugPrint("%s open error!!!\n", keymgr::kScDigestPath);
     return 1;
@@ -73,7 +73,7 @@ int ReadDigestHDD(std::uint8_t* dst) {
     return 1;
   }
   // A short file leaves the caller's zeros, which then fail the comparison.
-  std::size_t got = std::fread(dst, 1, kDigestSize, file.get());
+  std::size_t got = std::fread(dst, 1, kScDigestSize, file.get());
   (void)got;
   return 0;
 }

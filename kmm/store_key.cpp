@@ -102,8 +102,8 @@ int GenerateStoreKey(KeyContext* context) {
   TpmSecret password;
   TpmSecretHex nameHex;
   TpmSecretHex passHex;
-  Secret<kNameDigestSize> nameDigest;
-  Secret<kNameDigestSize> passDigest;
+  Secret<keymgr::crypto::kMd5Size> nameDigest;
+  Secret<keymgr::crypto::kMd5Size> passDigest;
   // Cleared so that the bytes past the sealed fragment are defined on disk.
   std::array<std::uint8_t, kStoredOokSize> storedOok{};
   std::uint32_t storedOokSize = kStoredOokSize;

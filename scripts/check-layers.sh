@@ -1,9 +1,10 @@
 #!/usr/bin/env bash
 # Fails when a source of the product includes a header of a higher layer, or
 # of a peer on its own layer. The layers, bottom up:
-#   0 util        bytes, hex, endian, scope guards, secrets, status, owned handles
-#   1 crypto      hashing and the crypto services
-#   2 verdict     the boot verdict's measurement and its event log
+#   0 util        bytes, hex, endian, whole-file reads, scope guards, secrets, status,
+#                 owned handles
+#   1 crypto      hashing, the owned libcrypto handles and the crypto services
+#   2 verdict     the boot verdict's measurement and its event log's codec
 #   3 eeprom      the EEPROM library    3 tpm     the platform key manager
 #   4 bootlog     the boot status log and the security-feature test
 #   5 integrity   the manifest          5 kmm     the key-management module

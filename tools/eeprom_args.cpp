@@ -4,7 +4,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "util/bytes.h"
+#include "util/hex.h"
 
 namespace keymgr::tools {
 
@@ -29,19 +29,6 @@ bool ParseNumber(const char* text, std::uint32_t* value) {
     return false;
   }
   *value = static_cast<std::uint32_t>(parsed);
-  return true;
-}
-
-// Decode turns |hex| (an even number of digits) into |bytes|.
-bool Decode(const char* hex, std::size_t length, std::span<std::uint8_t> bytes) {
-  for (std::size_t i = 0; i < length; ++i) {
-    const int high = HexDigitValue(hex[2 * i]);
-    const int low = HexDigitValue(hex[2 * i + 1]);
-    if (high < 0 || low < 0) {
-      return false;
-    }
-    bytes[i] = static_cast<std::uint8_t>(high << 4 | low);
-  }
   return true;
 }
 
@@ -93,12 +80,12 @@ EepromArgs ParseEepromArgs(int argc, const char* const* argv,
       return EepromArgs();
     }
     // A region takes exactly its own length.
-    if (digits == 0 || digits % 2 != 0 || (region != nullptr && digits != 2 * region->length)) {
+    if (digits == 0 || digits % 2 != 0 || (region != nullptr && digits / 2 != region->length)) {
       return EepromArgs();
     }
     args.action = Action::kWrite;
     args.length = digits / 2;
-    if (args.length <= bytes.size() && !Decode(argv[3], args.length, bytes)) {
+    if (args.length <= bytes.size() && !HexDecode({argv[3], digits}, bytes.first(args.length))) {
       return EepromArgs();
     }
   }

@@ -6,22 +6,20 @@
 // one of keymgr's, when its digest is not its verdict's, or when the replayed
 // PCR (the log's one PCR) is not HEX, the value a quote gave.
 #include <array>
-#include <cctype>
 #include <cerrno>
-#include <cstdint>
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <map>
 #include <string>
+#include <string_view>
 
+#include "util/hex.h"
 #include "util/owned.h"
-#include "verdict/verdict.h"
+#include "verdict/event_log.h"
 
 namespace {
 
 using keymgr::verdict::PcrValue;
-using keymgr::verdict::Verdict;
 
 int Fail(const std::string& what) {
   (void)std::fprintf(stderr, "keymgr-eventlog: %s\n", what.c_str());
@@ -29,44 +27,7 @@ int Fail(const std::string& what) {
 }
 
 std::string Hex(const PcrValue& value) {
-  return keymgr::verdict::DigestHex(value).data();
-}
-
-// Field returns the text of |name|'s value in |line|: up to the next quote
-// for a string, else up to the next comma or brace.
-std::string Field(const std::string& line, const char* name) {
-  const std::string key = std::string("\"") + name + "\":";
-  const std::size_t at = line.find(key);
-  if (at == std::string::npos) {
-    return "";
-  }
-  const std::size_t start = at + key.size() + (line[at + key.size()] == '"' ? 1 : 0);
-  return line.substr(start,
-                     line.find_first_of(line[start - 1] == '"' ? "\"" : ",}", start) - start);
-}
-
-// ReadRecord reads one record's PCR, digest and verdict; false for a line
-// that is not a record of keymgr's.
-bool ReadRecord(const std::string& line, unsigned* pcr, PcrValue* digest, std::string* verdict) {
-  const std::string index = Field(line, "pcr");
-  const std::string hex = Field(line, "digest");
-  *verdict = Field(line, "verdict");
-  char* end = nullptr;
-  *pcr = static_cast<unsigned>(std::strtoul(index.c_str(), &end, 10));
-  if (index.empty() || *end != '\0' || *pcr > 23 || Field(line, "hashAlg") != "sha256" ||
-      Field(line, "content_type") != "keymgr" || hex.size() != 64) {
-    return false;
-  }
-  for (std::size_t i = 0; i < digest->size(); ++i) {
-    // Two hex digits exactly: strtoul alone would take a sign or a blank.
-    const char pair[3] = {hex[2 * i], hex[2 * i + 1], '\0'};
-    if (std::isxdigit(static_cast<unsigned char>(pair[0])) == 0 ||
-        std::isxdigit(static_cast<unsigned char>(pair[1])) == 0) {
-      return false;
-    }
-    (*digest)[i] = static_cast<std::uint8_t>(std::strtoul(pair, nullptr, 16));
-  }
-  return true;
+  return keymgr::HexText(value, keymgr::HexCase::kLower).data();
 }
 
 }  // namespace
@@ -83,35 +44,29 @@ int main(int argc, char** argv) {
   std::map<unsigned, PcrValue> pcrs;
   std::array<char, 4096> buffer{};
   for (int number = 1; std::fgets(buffer.data(), buffer.size(), log.get()) != nullptr; ++number) {
-    const std::string line(buffer.data(), std::strcspn(buffer.data(), "\n"));
-    unsigned pcr = 0;
-    PcrValue digest{};
-    std::string verdict;
-    if (!ReadRecord(line, &pcr, &digest, &verdict)) {
+    const std::string_view line(buffer.data(), std::strcspn(buffer.data(), "\n"));
+    keymgr::verdict::Event event;
+    if (!keymgr::verdict::DecodeEvent(line, &event).ok() || event.pcr > 23) {
       return Fail("line " + std::to_string(number) + " is not a record of keymgr's");
     }
     // The digest is the verdict's: content that says otherwise was edited.
-    bool named = false;
-    for (Verdict v : {Verdict::kOk, Verdict::kFail, Verdict::kNone}) {
-      named = named || (verdict == keymgr::verdict::VerdictName(v) &&
-                        digest == keymgr::verdict::VerdictDigest(v));
-    }
-    if (!named) {
+    if (event.digest != keymgr::verdict::VerdictDigest(event.verdict)) {
       return Fail("line " + std::to_string(number) + ": the digest is not that of its verdict");
     }
-    std::printf("%d pcr %u sha256:%s %s\n", number - 1, pcr, Hex(digest).c_str(), verdict.c_str());
-    pcrs[pcr] = keymgr::verdict::Extended(pcrs[pcr], digest);
+    std::printf("%d pcr %u sha256:%s %s\n", number - 1, event.pcr, Hex(event.digest).c_str(),
+                keymgr::verdict::VerdictName(event.verdict));
+    pcrs[event.pcr] = keymgr::verdict::Extended(pcrs[event.pcr], event.digest);
   }
   for (const auto& [pcr, value] : pcrs) {
     std::printf("pcr %u replays to sha256:%s\n", pcr, Hex(value).c_str());
   }
   if (argc == 4) {
-    std::string expect = argv[3];
-    expect = expect.starts_with("0x") || expect.starts_with("0X") ? expect.substr(2) : expect;
-    for (char& c : expect) {
-      c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    std::string_view expect = argv[3];
+    if (expect.starts_with("0x") || expect.starts_with("0X")) {
+      expect.remove_prefix(2);
     }
-    if (pcrs.size() != 1 || Hex(pcrs.begin()->second) != expect) {
+    PcrValue value{};
+    if (pcrs.size() != 1 || !keymgr::HexDecode(expect, value) || value != pcrs.begin()->second) {
       return Fail("the log does not replay to " + std::string(argv[3]));
     }
   }

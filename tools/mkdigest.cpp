@@ -13,6 +13,7 @@
 
 #include <array>
 #include <cerrno>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -23,9 +24,11 @@
 #include "crypto/ed25519.h"
 #include "crypto/file_digest.h"
 #include "crypto/hash.h"
+#include "crypto/openssl_handles.h"
 #include "integrity/manifest.h"
 #include "integrity/signature.h"
 #include "util/atomic_file.h"
+#include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"
 
@@ -143,35 +146,18 @@ std::string InRoot(const std::string& root, const std::string& entry) {
   return Under(root, at);
 }
 
-// ReadAll reads the file at |path| whole.
-bool ReadAll(const std::string& path, std::string& bytes) {
-  const keymgr::File file(std::fopen(path.c_str(), "rb"));
-  if (!file) {
-    return false;
-  }
-  std::array<char, 65536> buffer{};
-  for (std::size_t got; (got = std::fread(buffer.data(), 1, buffer.size(), file.get())) > 0;) {
-    bytes.append(buffer.data(), got);
-  }
-  return std::ferror(file.get()) == 0;
-}
-
-std::array<std::uint8_t, 32> Sha256Of(const std::string& bytes) {
-  return keymgr::crypto::Sha256Of(
-      {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()});
-}
-
 // Sign lays out keymgr.sig for |manifest| and |digests| in |bytes|, signed
 // with the private key in args.key.
-int Sign(const Args& args, const std::string& manifest, const std::string& digests,
+int Sign(const Args& args, std::span<const std::uint8_t> manifest,
+         std::span<const std::uint8_t> digests,
          std::span<std::uint8_t, keymgr::integrity::kSignatureFileSize> bytes) {
   const keymgr::File pem(std::fopen(args.key.c_str(), "r"));
-  const keymgr::Owned<EVP_PKEY*, EVP_PKEY_free> key(
-      pem ? PEM_read_PrivateKey(pem.get(), nullptr, nullptr, nullptr) : nullptr);
+  const keymgr::crypto::EvpPkey key(pem ? PEM_read_PrivateKey(pem.get(), nullptr, nullptr, nullptr)
+                                        : nullptr);
   keymgr::integrity::SignatureFile file;
   file.counter = args.counter;
-  file.listDigest = Sha256Of(manifest);
-  file.digestsDigest = Sha256Of(digests);
+  file.listDigest = keymgr::crypto::Sha256Of(manifest);
+  file.digestsDigest = keymgr::crypto::Sha256Of(digests);
   keymgr::integrity::PublicKey publicKey{};
   if (!keymgr::crypto::Ed25519PublicKey(key.get(), publicKey).ok()) {
     return Fail(args.key + ": not an Ed25519 private key in PEM");
@@ -203,18 +189,21 @@ int main(int argc, char** argv) {
   }
   // The manifest is read once: the entries hashed are those of the bytes
   // whose digest is signed.
-  std::string manifest;
-  if (!ReadAll(args.manifest, manifest)) {
+  const keymgr::File file(std::fopen(args.manifest.c_str(), "rb"));
+  keymgr::HeapBytes bytes;
+  std::size_t size = 0;
+  if (!file || !keymgr::ReadWhole(file.get(), SIZE_MAX, bytes, &size)) {
     return Fail(args.manifest + ": " + std::strerror(errno));
   }
-  const keymgr::File entries(::fmemopen(manifest.data(), manifest.size(), "r"));
-  std::string digests;
+  const std::span<const std::uint8_t> manifest(bytes.get(), size);
+  const keymgr::File entries(::fmemopen(bytes.get(), size, "r"));
+  std::vector<std::uint8_t> digests;
   keymgr::integrity::EntryBuffer entry{};
   EntryRead read = EntryRead::kReadError;
   while (entries &&
          (read = keymgr::integrity::ReadEntry(entries.get(), entry)) == EntryRead::kEntry) {
     const std::string path = InRoot(args.root, entry.data());
-    std::array<std::uint8_t, keymgr::kFileDigestSize> digest{};
+    std::array<std::uint8_t, keymgr::crypto::kSha256Size> digest{};
     const keymgr::HashResult hashed = path.empty()
                                           ? keymgr::HashResult{keymgr::HashResult::kStat, {}}
                                           : keymgr::ComputeFileDigest(path.c_str(), digest);
@@ -222,7 +211,7 @@ int main(int argc, char** argv) {
       return Fail(std::string(entry.data()) + ": cannot be hashed (" +
                   (hashed.failure == keymgr::HashResult::kStat ? "status" : "open") + " error)");
     }
-    digests.append(reinterpret_cast<const char*>(digest.data()), digest.size());
+    digests.insert(digests.end(), digest.begin(), digest.end());
     entry.fill(0);
   }
   if (read != EntryRead::kEnd) {

@@ -1,9 +1,9 @@
 #include "util/bytes.h"
 
 #include <cstddef>
-#include <cstring>
 
 #include "util/debug_print.h"
+#include "util/hex.h"
 
 void PrintHexDump(const std::uint8_t* bytes, std::uint32_t length, int grouped) {
   for (std::uint32_t i = 0; i < length; ++i) {
@@ -44,7 +44,6 @@ void PrintRedactedArray(std::int32_t size) {
 }
 
 int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uint8_t dstSize) {
-  static constexpr char kDigits[] = "0123456789ABCDEF";
   if (src == nullptr || length == 0 || dst == nullptr || dstSize == 0) {
     DebugPrint("ERR: Null pointer detecter or zero length\n");
     return -1;
@@ -55,10 +54,7 @@ int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst, std::uin
     DebugPrint("ERR: to short destination buffer");
     return -1;
   }
-  for (std::size_t i = 0; i < length; ++i) {
-    dst[2 * i] = kDigits[src[i] >> 4];
-    dst[2 * i + 1] = kDigits[src[i] & 0x0F];
-  }
+  keymgr::HexEncode({src, length}, dst, keymgr::HexCase::kUpper);
   dst[std::size_t{2} * length] = '\0';
   return 0;
 }

@@ -21,18 +21,3 @@ void PrintRedactedArray(std::int32_t size);
 // and |dst| untouched on a null pointer, a zero size or a short |dst|.
 [[nodiscard]] int BytesToHex(const std::uint8_t* src, std::uint8_t length, char* dst,
                              std::uint8_t dstSize);
-
-// HexDigitValue returns the value of one hexadecimal digit of either case,
-// or -1 for any other character.
-constexpr int HexDigitValue(char c) {
-  if (c >= '0' && c <= '9') {
-    return c - '0';
-  }
-  if (c >= 'a' && c <= 'f') {
-    return c - 'a' + 10;
-  }
-  if (c >= 'A' && c <= 'F') {
-    return c - 'A' + 10;
-  }
-  return -1;
-}

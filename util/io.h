@@ -1,4 +1,5 @@
-// Loops for system calls that may move fewer bytes than asked.
+// Loops for system calls that may move fewer bytes than asked, and the one
+// reader of a whole file.
 #pragma once
 
 #include <sys/types.h>
@@ -6,6 +7,9 @@
 
 #include <cerrno>
 #include <cstddef>
+#include <cstdio>
+
+#include "util/owned.h"
 
 namespace keymgr {
 
@@ -36,5 +40,10 @@ inline bool WriteAll(int fd, const void* bytes, std::size_t size) {
   return MoveAll([&](std::size_t done, std::size_t left) { return ::write(fd, at + done, left); },
                  size);
 }
+
+// ReadWhole reads |stream| to its end into |bytes|, grown from malloc as it
+// fills, and sets |*size|. False with errno on a read error, when memory runs
+// out, or with EFBIG when the stream holds more than |limit| bytes.
+bool ReadWhole(std::FILE* stream, std::size_t limit, HeapBytes& bytes, std::size_t* size);
 
 }  // namespace keymgr

@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <utility>
 
 namespace keymgr {
@@ -48,6 +49,9 @@ class Owned {
   Handle handle_ = kNone;
 };
 
+inline void FreeBytes(std::uint8_t* bytes) {
+  std::free(bytes);
+}
 inline void CloseStream(std::FILE* f) {
   (void)std::fclose(f);
 }
@@ -55,7 +59,9 @@ inline void CloseDescriptor(int fd) {
   ::close(fd);
 }
 
-// File closes its stream, Descriptor its file descriptor.
+// HeapBytes frees bytes from malloc, File closes its stream, Descriptor its
+// file descriptor.
+using HeapBytes = Owned<std::uint8_t*, FreeBytes>;
 using File = Owned<std::FILE*, CloseStream>;
 using Descriptor = Owned<int, CloseDescriptor, -1>;
 

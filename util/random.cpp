@@ -13,7 +13,7 @@ bool KernelRandom(std::uint8_t* dst, std::size_t size, KernelWait wait) {
     return ::getrandom(dst + done, left, flags);
   };
   if (!MoveAll(draw, size)) {
-    (void)ErrnoFailure("getrandom");
+    LogErrno("getrandom");
     return false;
   }
   return true;

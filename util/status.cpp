@@ -7,7 +7,7 @@
 
 namespace keymgr {
 
-Status Status::Failure(Origin origin, const char* call, std::uint32_t code, const char* text) {
+void LogFailure(Origin origin, const char* call, std::uint32_t code, const char* text) {
   if (DiagnosticsOn()) {
     const int saved = errno;  // callers may still report errno
     if (text == nullptr && origin == Origin::kErrno) {
@@ -20,6 +20,10 @@ Status Status::Failure(Origin origin, const char* call, std::uint32_t code, cons
     }
     errno = saved;
   }
+}
+
+Status Status::Failure(Origin origin, const char* call, std::uint32_t code, const char* text) {
+  LogFailure(origin, call, code, text);
   return Status(origin, call, code);
 }
 

@@ -48,4 +48,15 @@ inline Status Refused(const char* what) {
   return Status::Failure(Origin::kRefused, what, 0);
 }
 
+// LogFailure shows a failure as Status::Failure does, for one that no caller
+// is told of: the flow goes on, or its result is fixed by an interface that
+// has no room for the cause. Any origin's code fits, a TSS2_RC too.
+void LogFailure(Origin origin, const char* call, std::uint32_t code, const char* text = nullptr);
+inline void LogErrno(const char* call, int error = errno) {
+  LogFailure(Origin::kErrno, call, static_cast<std::uint32_t>(error));
+}
+inline void LogRefused(const char* what) {
+  LogFailure(Origin::kRefused, what, 0);
+}
+
 }  // namespace keymgr

@@ -33,14 +33,4 @@ PcrValue GoodPcrValue() {
   return Extended(PcrValue{}, VerdictDigest(Verdict::kOk));
 }
 
-std::array<char, 65> DigestHex(const PcrValue& digest) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::array<char, 65> text{};
-  for (std::size_t i = 0; i < digest.size(); ++i) {
-    text[2 * i] = kDigits[digest[i] >> 4];
-    text[2 * i + 1] = kDigits[digest[i] & 15];
-  }
-  return text;
-}
-
 }  // namespace keymgr::verdict

@@ -7,11 +7,13 @@
 #include <array>
 #include <cstdint>
 
+#include "crypto/hash.h"
+
 namespace keymgr::verdict {
 
 enum class Verdict { kOk, kFail, kNone };
 
-using PcrValue = std::array<std::uint8_t, 32>;
+using PcrValue = std::array<std::uint8_t, crypto::kSha256Size>;
 
 // VerdictDigest is the SHA-256 of "keymgr boot verdict: " and BN=OK,
 // BN=FAIL, or "none" for a run that verified nothing.
@@ -27,9 +29,5 @@ PcrValue GoodPcrValue();
 
 // VerdictName is the verdict as the event log names it.
 const char* VerdictName(Verdict verdict);
-
-// DigestHex is |digest| in lower-case hex with a terminating NUL, as the
-// event log writes digests.
-std::array<char, 65> DigestHex(const PcrValue& digest);
 
 }  // namespace keymgr::verdict

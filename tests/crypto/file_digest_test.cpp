@@ -35,7 +35,7 @@ TEST(FileDigestTest, HashesTheStatSizeAcrossReads) {
     EXPECT_TRUE(keymgr::OpenFileToHash(path.c_str(), file, true).ok());
     change();
     keymgr::FileHasher hasher;
-    std::array<std::uint8_t, keymgr::kFileDigestSize> digest{};
+    std::array<std::uint8_t, keymgr::crypto::kSha256Size> digest{};
     const keymgr::Status result = keymgr::HashOpenFile(hasher, file, digest, &stop);
     EXPECT_FALSE(file.fd) << "closed once hashed";
     return result.ok() ? std::string(digest.begin(), digest.end())

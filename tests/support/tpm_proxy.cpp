@@ -8,6 +8,8 @@
 #include <tuple>
 #include <utility>
 
+#include "util/endian.h"
+
 namespace keymgr::test {
 
 namespace {
@@ -33,8 +35,7 @@ int UnixSocket(const std::string& path, bool listening) {
 }
 
 std::uint32_t Big(const char* p) {
-  const auto* u = reinterpret_cast<const unsigned char*>(p);
-  return std::uint32_t{u[0]} << 24 | std::uint32_t{u[1]} << 16 | std::uint32_t{u[2]} << 8 | u[3];
+  return LoadBig32(reinterpret_cast<const std::uint8_t*>(p));
 }
 
 // ReadMessage reads one command or response whole.

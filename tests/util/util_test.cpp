@@ -1,10 +1,13 @@
 #include <gtest/gtest.h>
 
+#include <array>
 #include <numeric>
 #include <string>
 
 #include "support/sandbox.h"
 #include "util/bytes.h"
+#include "util/endian.h"
+#include "util/hex.h"
 
 namespace {
 
@@ -46,6 +49,26 @@ TEST(BytesTest, PrintersAndHex) {
   dst[255] = 'Q';
   EXPECT_EQ(Output([&] { EXPECT_EQ(BytesToHex(b + 128, 127, dst, 255), 0); }), "");
   EXPECT_EQ(std::string(dst, 4) + std::string(dst + 250, 6), std::string("8081FDFE\0Q", 10));
+}
+
+// Hex text decodes two digits a byte, of either case, and nothing else; big-
+// endian integers store and load back, most significant byte first.
+TEST(BytesTest, HexAndEndian) {
+  std::array<std::uint8_t, 2> two{};
+  EXPECT_TRUE(keymgr::HexDecode("0aF9", two));
+  EXPECT_EQ(two, (std::array<std::uint8_t, 2>{0x0A, 0xF9}));
+  for (const char* bad : {"0aF", "0aF9b", "0aF ", "+aF9", "0xF9", "0g00", ""}) {
+    EXPECT_FALSE(keymgr::HexDecode(bad, two)) << bad;
+  }
+  EXPECT_STREQ(keymgr::HexText(two, keymgr::HexCase::kLower).data(), "0af9");
+  std::array<std::uint8_t, 8> b{};
+  keymgr::StoreBig64(b.data(), 0x0102030405060708u);
+  EXPECT_EQ(b, (std::array<std::uint8_t, 8>{1, 2, 3, 4, 5, 6, 7, 8}));
+  EXPECT_EQ(keymgr::LoadBig16(b.data() + 6), 0x0708u);
+  keymgr::StoreBig32(b.data(), 0xFFFEFDFCu);
+  keymgr::StoreBig16(b.data() + 4, 0x8000u);
+  EXPECT_EQ(keymgr::LoadBig64(b.data()), 0xFFFEFDFC80000708u);
+  EXPECT_EQ(keymgr::LoadBig32(b.data() + 2), 0xFDFC8000u);
 }
 
 }  // namespace
