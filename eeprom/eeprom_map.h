@@ -37,6 +37,14 @@ inline constexpr std::uint8_t kControlEnableBit = 0x40;
 inline constexpr std::uint32_t kScDigestOffset = 32256;
 inline constexpr std::uint32_t kScDigestLength = 32;
 
+// The pin of the TPM's storage key in measured and sealed builds: the
+// SHA-256 part of its name, which sessions that carry secrets or record the
+// verdict are salted to. Written when a regeneration creates a key under it,
+// or by the first boot that finds it blank. Off the disk, so that someone
+// who rewrites the disk cannot pin a key of his own.
+inline constexpr std::uint32_t kStorageKeyPinOffset = 32288;
+inline constexpr std::uint32_t kStorageKeyPinLength = 32;
+
 // Region is one region of the map by name, for tools and tests that read
 // or write it.
 struct Region {
@@ -49,10 +57,12 @@ inline constexpr Region kRegions[] = {
     {"sfe-conf", kSfeConfOffset, kSfeConfLength},
     {"control", kControlByteOffset, 1},
     {"sc-digest", kScDigestOffset, kScDigestLength},
+    {"storage-key-pin", kStorageKeyPinOffset, kStorageKeyPinLength},
 };
 
 static_assert(kStoreKeyOffset >= kSectionStart &&
               kStoreKeyOffset + kStoreKeyLength <= kSectionStart + kSectionLength);
-static_assert(kScDigestOffset + kScDigestLength <= kSize);
+static_assert(kScDigestOffset + kScDigestLength <= kStorageKeyPinOffset &&
+              kStorageKeyPinOffset + kStorageKeyPinLength <= kSize);
 
 }  // namespace keymgr::eeprom

@@ -15,7 +15,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
-declare -A rank=([util]=0 [crypto]=1 [verdict]=2 [eeprom]=3 [tpm]=3 [bootlog]=4 [integrity]=5
+declare -A rank=([util]=0 [crypto]=1 [verdict]=2 [policy]=2 [eeprom]=3 [tpm]=4 [bootlog]=4 [integrity]=5
                  [kmm]=5 [cli]=6 [tools]=6 [bench]=6)
 status=0
 for dir in "${!rank[@]}"; do

@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "crypto/hash.h"
+#include "util/endian.h"
 
 namespace keymgr::tpm {
 
@@ -45,7 +46,7 @@ bool NameMatches(const TPM2B_PUBLIC& area, const TPM2B_NAME& name) {
          Tss2_MU_TPMT_PUBLIC_Marshal(&area.publicArea, marshalled.data(), marshalled.size(),
                                      &size) == TSS2_RC_SUCCESS &&
          sha.Update(marshalled.data(), size).ok() && sha.Final(digest).ok() &&
-         name.name[0] == (TPM2_ALG_SHA256 >> 8) && name.name[1] == (TPM2_ALG_SHA256 & 0xFF) &&
+         LoadBig16(name.name) == TPM2_ALG_SHA256 &&
          std::memcmp(name.name + 2, digest.data(), digest.size()) == 0;
 }
 

@@ -102,6 +102,12 @@ Status TssFailure(const char* call, TSS2_RC rc) {
   return Status::Failure(Origin::kTss, call, rc, Tss2_RC_Decode(rc));
 }
 
+void LogTss(const char* call, TSS2_RC rc) {
+  if (rc != TSS2_RC_SUCCESS) {
+    LogFailure(Origin::kTss, call, rc, Tss2_RC_Decode(rc));
+  }
+}
+
 void FinalizeTcti(TSS2_TCTI_CONTEXT* tcti) {
   if (IsSocketTcti(tcti)) {
     FinalizeSocketTcti(tcti);
@@ -130,8 +136,8 @@ void CloseObject(EsysObject object) {
   TPM2B_AUTH blank{};
   blank.size = 16;
   ESYS_CONTEXT* esys = object.tpm->ctx();
-  (void)Check("Esys_TR_SetAuth", Esys_TR_SetAuth(esys, object.tr, &blank));
-  (void)Check("Esys_TR_Close", Esys_TR_Close(esys, &object.tr));
+  LogTss("Esys_TR_SetAuth", Esys_TR_SetAuth(esys, object.tr, &blank));
+  LogTss("Esys_TR_Close", Esys_TR_Close(esys, &object.tr));
 }
 
 void WipeResponse(Connection& tpm) {

@@ -10,6 +10,7 @@
 #include <tss2/tss2_tctildr.h>
 
 #include <cstdint>
+#include <span>
 
 #include "util/owned.h"
 #include "util/status.h"
@@ -23,19 +24,26 @@ struct Options {
   const char* transport = nullptr;
   // The deadline of every command, in milliseconds.
   int deadlineMs = 0;
-  // The PCR of the SHA-256 bank that the keys this connection creates and
-  // opens require at the good boot verdict's value, or -1 for plain keys.
+  // The PCR of the SHA-256 bank that holds the boot verdict, when the keys
+  // this connection creates and opens are sealed to the boot (a build with
+  // KEYMGR_SEAL_TO_VERDICT), or -1 for plain keys.
   int sealPcr = -1;
+  // The modulus of the vendor's RSA key whose signed policies sealed keys
+  // follow (KEYMGR_POLICY_PUBKEY); empty in other builds.
+  std::span<const std::uint8_t> vendorKey;
 };
 
-// BuildOptions are the build's: KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS and
-// KEYMGR_SEAL_PCR. Defined alone in options.cpp, so that a test program can
-// link its own in their place.
+// BuildOptions are the build's: KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS,
+// KEYMGR_SEAL_PCR and KEYMGR_POLICY_PUBKEY. Defined alone in options.cpp, so that a test program
+// can link its own in their place.
 Options BuildOptions();
 
 // TssFailure names a failed tpm2-tss call once, with the decoded code, on
 // request (KEYMGR_DEBUG).
 Status TssFailure(const char* call, TSS2_RC rc);
+
+// LogTss names a tpm2-tss call that failed where no caller is told.
+void LogTss(const char* call, TSS2_RC rc);
 
 // Check is the status of a tpm2-tss call that returned |rc|.
 inline Status Check(const char* call, TSS2_RC rc) {

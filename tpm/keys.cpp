@@ -9,9 +9,12 @@
 
 #include "crypto/hash.h"
 #include "keymgr_build_config.h"
+#include "policy/digests.h"
+#include "policy/file.h"
 #include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
+#include "util/endian.h"
 #include "util/secure.h"
 #include "verdict/verdict.h"
 
@@ -24,7 +27,7 @@ namespace {
 // (that would take a preimage), so it grants nothing, but it marks the key:
 // only objects that carry it, with the exact template below, are ever
 // evicted, never what other software made persistent in the owner range.
-constexpr uint8_t kKeyMarker[32] = {
+constexpr policy::Digest kKeyMarker = {
     0x6d, 0x92, 0x2a, 0xfd, 0xc6, 0xec, 0xa3, 0xf8, 0x6b, 0xc5, 0xa5, 0x93, 0xa1, 0x93, 0x9a, 0x34,
     0x0c, 0xe7, 0x29, 0x9b, 0x0e, 0x44, 0x81, 0x0d, 0x26, 0x78, 0xc8, 0x7b, 0x01, 0x65, 0x84, 0xd6};
 constexpr TPMA_OBJECT kKeyAttributes = TPMA_OBJECT_DECRYPT | TPMA_OBJECT_FIXEDTPM |
@@ -39,63 +42,52 @@ constexpr uint32_t kOwnKeysFirst = 0x81020000u;
 constexpr uint32_t kOwnerPersistentLast = 0x817FFFFFu;
 
 // The handle of a key is derived from the first three bytes of its name
-// digest, read big-endian. MD5 spreads the names evenly, so two live keys
-// meet on one handle with odds of about 1 in 8 million; pcp_create_key then
+// digest, read big-endian (the top byte of the first four dropped). MD5 spreads the names evenly,
+// so two live keys meet on one handle with odds of about 1 in 8 million; pcp_create_key then
 // refuses rather than overwrite the other key.
 uint32_t PersistentHandle(const uint8_t* nameDigest) {
-  const uint32_t bits =
-      (uint32_t{nameDigest[0]} << 16) | (uint32_t{nameDigest[1]} << 8) | nameDigest[2];
+  const uint32_t bits = LoadBig32(nameDigest) >> 8;
   return kOwnKeysFirst + bits % (kOwnerPersistentLast - kOwnKeysFirst + 1);
 }
 
 // A sealed key's user role is reached only through its policy.
 constexpr TPMA_OBJECT kSealedKeyAttributes = kKeyAttributes & ~TPMA_OBJECT_USERWITHAUTH;
 
-void PutBig32(crypto::Sha256& sha, uint32_t value) {
-  const uint8_t bytes[4] = {static_cast<uint8_t>(value >> 24), static_cast<uint8_t>(value >> 16),
-                            static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)};
-  (void)sha.Update(bytes, sizeof(bytes));
+// VerdictPolicy is the authPolicy of a key sealed to PCR |pcr| alone by the
+// builds before the vendor's policies: TPM2_PolicyPCR with the PCR at the
+// good verdict's value, then TPM2_PolicyAuthValue. Such keys are still known,
+// so that they are swept, but no longer opened.
+policy::Digest VerdictPolicy(int pcr) {
+  const policy::Digest good[] = {verdict::GoodPcrValue()};
+  return policy::PolicyAuthValue(
+      policy::PolicyPcr(policy::Digest{}, policy::PcrMask{1} << pcr, policy::PcrDigest(good)));
 }
 
-// VerdictPolicy is the authPolicy of a key sealed to PCR |pcr|: TPM2_PolicyPCR
-// with the PCR at the good verdict's value, then TPM2_PolicyAuthValue, as the
-// TPM computes them from an empty policy. Like the marker, it depends on
-// nothing that a regeneration or an update changes, so it marks the keys of
-// this system as well.
-TPM2B_DIGEST VerdictPolicy(int pcr) {
-  const std::array<uint8_t, 32> pcrDigest = crypto::Sha256Of(verdict::GoodPcrValue());
-  std::array<uint8_t, sizeof(TPML_PCR_SELECTION)> selection{};
-  std::size_t size = 0;
-  const TPML_PCR_SELECTION pcrs = PcrSelection(pcr);
-  (void)Tss2_MU_TPML_PCR_SELECTION_Marshal(&pcrs, selection.data(), selection.size(), &size);
-  TPM2B_DIGEST policy{};
-  policy.size = 32;
-  crypto::Sha256 first;
-  (void)first.Update(policy.buffer, 32);
-  PutBig32(first, TPM2_CC_PolicyPCR);
-  (void)first.Update(selection.data(), size);
-  (void)first.Update(pcrDigest.data(), pcrDigest.size());
-  (void)first.Final(std::span<uint8_t, 32>(policy.buffer, 32));
-  crypto::Sha256 second;
-  (void)second.Update(policy.buffer, 32);
-  PutBig32(second, TPM2_CC_PolicyAuthValue);
-  (void)second.Final(std::span<uint8_t, 32>(policy.buffer, 32));
-  return policy;
+// AuthorizedPolicy is the authPolicy of a key sealed under the vendor key
+// |vendor|: whatever policy the vendor approved for the key, then the key's
+// password. It depends on nothing a regeneration or an update changes, so
+// it marks the keys of this system as well.
+policy::Digest AuthorizedPolicy(std::span<const uint8_t> vendor) {
+  return policy::PolicyAuthValue(
+      policy::PolicyAuthorize(policy::RsaSigningKeyName(vendor), policy::kKeyPolicyRef));
 }
 
 // IsOwnKey tells whether |area| is the public area of a key this key manager
-// created: its template, and the marker or, for a sealed key, the verdict
-// policy of one of the 24 PCRs. Keys of plain and sealed builds are both
-// known, so that changing the build strands none.
-bool IsOwnKey(const TPMT_PUBLIC& area) {
+// created: its template, and the marker or, for a sealed key, the policy of
+// |vendor| or a verdict policy of one of the 24 PCRs. Keys of plain and
+// sealed builds are all known, so that changing the build strands none.
+bool IsOwnKey(const TPMT_PUBLIC& area, std::span<const uint8_t> vendor) {
   const TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
-  const bool plain = area.objectAttributes == kKeyAttributes && area.authPolicy.size == 32 &&
-                     std::memcmp(area.authPolicy.buffer, kKeyMarker, 32) == 0;
-  bool sealed = false;
-  for (int pcr = 0; pcr < 24 && !plain && !sealed &&
-                    area.objectAttributes == kSealedKeyAttributes && area.authPolicy.size == 32;
+  const auto carries = [&](std::span<const uint8_t, 32> policy) {
+    return area.authPolicy.size == 32 &&
+           std::memcmp(area.authPolicy.buffer, policy.data(), 32) == 0;
+  };
+  const bool plain = area.objectAttributes == kKeyAttributes && carries(kKeyMarker);
+  bool sealed = area.objectAttributes == kSealedKeyAttributes && !vendor.empty() &&
+                carries(AuthorizedPolicy(vendor));
+  for (int pcr = 0; pcr < 24 && !plain && !sealed && area.objectAttributes == kSealedKeyAttributes;
        ++pcr) {
-    sealed = std::memcmp(area.authPolicy.buffer, VerdictPolicy(pcr).buffer, 32) == 0;
+    sealed = carries(VerdictPolicy(pcr));
   }
   return area.type == TPM2_ALG_RSA && area.nameAlg == TPM2_ALG_SHA256 && (plain || sealed) &&
          rsa.symmetric.algorithm == TPM2_ALG_NULL && rsa.scheme.scheme == TPM2_ALG_OAEP &&
@@ -104,23 +96,25 @@ bool IsOwnKey(const TPMT_PUBLIC& area) {
 
 }  // namespace
 
-TPML_PCR_SELECTION PcrSelection(int pcr) {
-  TPML_PCR_SELECTION pcrs{};
-  pcrs.count = 1;
-  pcrs.pcrSelections[0].hash = TPM2_ALG_SHA256;
-  pcrs.pcrSelections[0].sizeofSelect = 3;
-  pcrs.pcrSelections[0].pcrSelect[pcr / 8] = static_cast<uint8_t>(1u << (pcr % 8));
-  return pcrs;
+TPML_PCR_SELECTION PcrSelection(policy::PcrMask pcrs) {
+  TPML_PCR_SELECTION selection{};
+  selection.count = 1;
+  selection.pcrSelections[0].hash = TPM2_ALG_SHA256;
+  selection.pcrSelections[0].sizeofSelect = 3;
+  for (int i = 0; i < 3; ++i) {
+    selection.pcrSelections[0].pcrSelect[i] = static_cast<uint8_t>(pcrs >> (8 * i));
+  }
+  return selection;
 }
 
 uint32_t HandleOfName(const char* nameHex) {
-  uint8_t nameDigest[kDigestSize];
+  uint8_t nameDigest[crypto::kMd5Size];
   (void)Md5OfString(nameHex, nameDigest);  // always 0
   return PersistentHandle(nameDigest);
 }
 
-uint32_t ModulusSize(const TPMT_PUBLIC& area) {
-  const uint32_t size = IsOwnKey(area) ? area.parameters.rsaDetail.keyBits / 8u : 0;
+uint32_t ModulusSize(const TPMT_PUBLIC& area, std::span<const uint8_t> vendor) {
+  const uint32_t size = IsOwnKey(area, vendor) ? area.parameters.rsaDetail.keyBits / 8u : 0;
   return size > kOaepOverhead && size <= kMaxCipherSize && area.unique.rsa.size == size ? size : 0;
 }
 
@@ -132,21 +126,21 @@ Status ReadOwnKey(Connection& tpm, uint32_t handle, TPM2B_PUBLIC* area) {
   if (Status status = ReadPublic(tpm, handle, area); !status.ok()) {
     return status;
   }
-  return ModulusSize(area->publicArea) != 0 ? Status() : Refused("not a key of this system");
+  return ModulusSize(area->publicArea, tpm.options.vendorKey) != 0
+             ? Status()
+             : Refused("not a key of this system");
 }
 
 // KeyTemplate is the template of every key this key manager creates.
-TPM2B_TEMPLATE KeyTemplate(uint32_t bits, int sealPcr) {
+TPM2B_TEMPLATE KeyTemplate(uint32_t bits, const Options& options) {
+  const bool sealed = options.sealPcr >= 0;
   TPMT_PUBLIC area{};
   area.type = TPM2_ALG_RSA;
   area.nameAlg = TPM2_ALG_SHA256;
-  area.objectAttributes = sealPcr >= 0 ? kSealedKeyAttributes : kKeyAttributes;
-  if (sealPcr >= 0) {
-    area.authPolicy = VerdictPolicy(sealPcr);
-  } else {
-    area.authPolicy.size = sizeof(kKeyMarker);
-    std::memcpy(area.authPolicy.buffer, kKeyMarker, sizeof(kKeyMarker));
-  }
+  area.objectAttributes = sealed ? kSealedKeyAttributes : kKeyAttributes;
+  const policy::Digest policy = sealed ? AuthorizedPolicy(options.vendorKey) : kKeyMarker;
+  area.authPolicy.size = policy.size();
+  std::memcpy(area.authPolicy.buffer, policy.data(), policy.size());
   TPMS_RSA_PARMS& rsa = area.parameters.rsaDetail;
   rsa.symmetric.algorithm = TPM2_ALG_NULL;
   rsa.scheme.scheme = TPM2_ALG_OAEP;
@@ -177,9 +171,9 @@ Status CreateKey(Connection& tpm, const uint8_t* nameDigest, const uint8_t* pass
   }
   TPM2B_SENSITIVE_CREATE sensitive{};
   ScopeExit wipeSensitive([&] { OPENSSL_cleanse(&sensitive, sizeof(sensitive)); });
-  sensitive.sensitive.userAuth.size = kDigestSize;
-  std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, kDigestSize);
-  const TPM2B_TEMPLATE templ = KeyTemplate(bits, tpm.options.sealPcr);
+  sensitive.sensitive.userAuth.size = crypto::kMd5Size;
+  std::memcpy(sensitive.sensitive.userAuth.buffer, passwordDigest, crypto::kMd5Size);
+  const TPM2B_TEMPLATE templ = KeyTemplate(bits, tpm.options);
 
   ESYS_TR loaded = ESYS_TR_NONE;
   Output<TPM2B_PUBLIC> keyPublic;

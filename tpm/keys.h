@@ -9,12 +9,11 @@
 #include <cstdint>
 #include <span>
 
+#include "policy/digests.h"
 #include "tpm/connection.h"
 
 namespace keymgr::tpm {
 
-// The size of the MD5 digests that name a key and authorise it.
-inline constexpr std::uint32_t kDigestSize = 16;
 // Largest single draw; the callers ask for 20 or 32 bytes.
 inline constexpr std::uint32_t kMaxRandom = 1024;
 // OAEP with SHA-256 spends two digests and two bytes of the modulus.
@@ -25,8 +24,9 @@ inline constexpr std::uint32_t kOaepOverhead = 2 * 32 + 2;
 // HandleOfName is the persistent handle of the key named by |nameHex|.
 std::uint32_t HandleOfName(const char* nameHex);
 // ModulusSize is the size in bytes of the modulus of a key this key manager
-// created, which leaves room for OAEP and fits the fragment; 0 for any other.
-std::uint32_t ModulusSize(const TPMT_PUBLIC& area);
+// created (sealed ones under the vendor key |vendor|), which leaves room for
+// OAEP and fits the fragment; 0 for any other.
+std::uint32_t ModulusSize(const TPMT_PUBLIC& area, std::span<const std::uint8_t> vendor);
 // CreateKey creates an RSA-|bits| key (1024 or 2048) authorised by the
 // 16 bytes |passwordDigest| and makes it persistent at the handle of
 // |nameDigest|; its public area stays with the connection for sealing.
@@ -45,8 +45,8 @@ Status ListOwnKeys(Connection& tpm, std::span<std::uint32_t> handles, std::uint3
 // KEYMGR_SEAL_TO_VERDICT) creates keys that require that PCR at the good
 // boot verdict's value as well as their password, and opens their fragments
 // in a policy session that meets it.
-// PcrSelection selects PCR |pcr| of the SHA-256 bank.
-TPML_PCR_SELECTION PcrSelection(int pcr);
+// PcrSelection selects the PCRs of |pcrs| in the SHA-256 bank.
+TPML_PCR_SELECTION PcrSelection(policy::PcrMask pcrs);
 
 // Sealing (seal.cpp).
 

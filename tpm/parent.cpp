@@ -1,9 +1,14 @@
 // The storage parent of the keys and the sessions that carry secrets.
 #include <time.h>
 
+#include <algorithm>
+#include <array>
 #include <cstring>
 
 #include "crypto/hash.h"
+#include "eeprom/eeprom.h"
+#include "eeprom/eeprom_map.h"
+#include "tpm/chain.h"
 #include "tpm/commands.h"
 #include "util/random.h"
 
@@ -86,6 +91,79 @@ Status UseParent(Connection& tpm) {
     return Status();
   }
   return tpm.broken ? Refused("TPM connection lost") : CreateSrkPrimary(tpm);
+}
+
+namespace {
+
+using Pin = std::array<std::uint8_t, eeprom::kStorageKeyPinLength>;
+
+// ParentName gives the SHA-256 part of the parent's name.
+Status ParentName(Connection& tpm, Pin* name) {
+  Output<TPM2B_NAME> full;
+  if (Status status =
+          Check("Esys_TR_GetName", Esys_TR_GetName(tpm.ctx(), tpm.Parent(), full.out()));
+      !status.ok()) {
+    return status;
+  }
+  if (full.get()->size != 2 + name->size()) {
+    return Refused("storage key name");
+  }
+  std::copy_n(full.get()->name + 2, name->size(), name->begin());
+  return Status();
+}
+
+bool Blank(const Pin& pin) {
+  return std::all_of(pin.begin(), pin.end(), [](std::uint8_t b) { return b == 0xFF; }) ||
+         std::all_of(pin.begin(), pin.end(), [](std::uint8_t b) { return b == 0x00; });
+}
+
+}  // namespace
+
+Status UsePinnedParent(Connection& tpm) {
+  Pin pin{};
+  const bool readable = ReadEEPROM_msok(eeprom::kDevice, eeprom::kStorageKeyPinOffset,
+                                        eeprom::kStorageKeyPinLength, pin.data()) >= 0;
+  const bool pinned = readable && !Blank(pin);
+  // A pinned SRK needs no look at its template: its name is the proof.
+  if (pinned && !tpm.primary && !tpm.srk) {
+    ESYS_TR srk = ESYS_TR_NONE;
+    if (OpenPersistent(tpm, kSrkHandle, &srk).ok()) {
+      tpm.srk.reset(tpm.Object(srk));
+    }
+  }
+  Pin name{};
+  if (Status status = UseParent(tpm); !status.ok()) {
+    return status;
+  }
+  if (Status status = ParentName(tpm, &name); !status.ok()) {
+    return status;
+  }
+  // Something else at the SRK's handle may stand in front of the pinned key,
+  // which is then the primary made from the template.
+  if (pinned && name != pin && tpm.srk && !tpm.primary) {
+    tpm.srk.reset();
+    if (Status status = CreateSrkPrimary(tpm); !status.ok()) {
+      return status;
+    }
+    if (Status status = ParentName(tpm, &name); !status.ok()) {
+      return status;
+    }
+  }
+  if (pinned && name != pin) {
+    return Refused("storage key is not the pinned one");
+  }
+  return pinned || !readable ? Status() : PinParent(tpm);
+}
+
+Status PinParent(Connection& tpm) {
+  Pin name{};
+  if (Status status = ParentName(tpm, &name); !status.ok()) {
+    return status;
+  }
+  return WriteEEPROM_Bytes_Sema(eeprom::kDevice, eeprom::kStorageKeyPinOffset,
+                                eeprom::kStorageKeyPinLength, name.data()) >= 0
+             ? Status()
+             : Refused("storage key pin write");
 }
 
 Status StartSession(Connection& tpm, ESYS_TR tpmKey, ESYS_TR bind, ESYS_TR* session, TPM2_SE type) {

@@ -6,23 +6,52 @@
 
 #include "crypto/hash.h"
 #include "crypto/rsa.h"
+#include "policy/file.h"
+#include "tpm/chain.h"
 #include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
+#include "util/io.h"
+#include "util/owned.h"
+#include "util/paths.h"
 #include "util/secure.h"
 
 namespace keymgr::tpm {
 
 namespace {
 
-// MeetVerdictPolicy runs the policy of a key sealed to PCR |pcr| in
-// |session|: the PCR as it is now, then the key's password, which the
-// decryption's HMAC then carries.
-Status MeetVerdictPolicy(Connection& tpm, ESYS_TR session, int pcr) {
-  if (Status status = PolicyPCR(tpm, session, PcrSelection(pcr)); !status.ok()) {
+// ReadPolicyFile reads the release's signed policy, which a sealed key
+// follows.
+Status ReadPolicyFile(policy::PolicyFile* file) {
+  const File stream = OpenFile(kPolicyPath, "r");
+  HeapBytes bytes;
+  std::size_t size = 0;
+  if (!stream || !ReadWhole(stream.get(), policy::kPolicyFileSize, bytes, &size)) {
+    return ErrnoFailure(kPolicyPath);
+  }
+  return policy::DecodePolicyFile({bytes.get(), size}, file);
+}
+
+// StartUnsealSession starts the session that carries the decryption. For a
+// plain key it is bound to the key: its session key comes from the key's
+// password, which the call has anyway, so the plaintext returns encrypted
+// without a second asymmetric operation. A sealed key opens only in a policy
+// session that meets the vendor's policy; that session is salted to the
+// pinned storage key, so that whoever has read the password from the disk
+// and listens on the bus still learns nothing, and TPM2_PolicyAuthValue
+// puts the password in its keys as binding would.
+Status StartUnsealSession(Connection& tpm, ESYS_TR key, ESYS_TR* session) {
+  if (tpm.options.sealPcr < 0) {
+    return StartSession(tpm, ESYS_TR_NONE, key, session, TPM2_SE_HMAC);
+  }
+  policy::PolicyFile file;
+  if (Status status = ReadPolicyFile(&file); !status.ok()) {
     return status;
   }
-  return PolicyAuthValue(tpm, session);
+  if (Status status = StartSaltedSession(tpm, TPM2_SE_POLICY, session); !status.ok()) {
+    return status;
+  }
+  return MeetKeyPolicy(tpm, *session, file);
 }
 
 }  // namespace
@@ -43,7 +72,7 @@ Status Seal(Connection& tpm, const char* nameHex, const uint8_t* data, uint32_t 
     return status;
   }
   const TPMT_PUBLIC& key = area.publicArea;
-  const uint32_t modulusSize = ModulusSize(key);
+  const uint32_t modulusSize = ModulusSize(key, tpm.options.vendorKey);
   if (modulusSize == 0 || length > modulusSize - kOaepOverhead) {
     return Refused("pcp_encryptDataFragment");
   }
@@ -66,10 +95,8 @@ Status Seal(Connection& tpm, const char* nameHex, const uint8_t* data, uint32_t 
   return Status();
 }
 
-// The session that carries the decryption is bound to the key: its session
-// key comes from the key's auth value, which the call has anyway, so the
-// plaintext returns encrypted without a second asymmetric operation. The
-// session ends with the command (continueSession clear).
+// The session that carries the decryption ends with the command
+// (continueSession clear).
 Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const uint8_t* fragment,
               uint32_t length, uint8_t* out, uint32_t* outSize) {
   if (nameHex == nullptr || passHex == nullptr || fragment == nullptr || out == nullptr ||
@@ -89,29 +116,20 @@ Status Unseal(Connection& tpm, const char* nameHex, const char* passHex, const u
   {
     TPM2B_AUTH auth{};
     ScopeExit wipeAuth([&] { OPENSSL_cleanse(&auth, sizeof(auth)); });
-    auth.size = kDigestSize;
+    auth.size = crypto::kMd5Size;
     (void)Md5OfString(passHex, auth.buffer);  // always 0
     if (Status status = Check("Esys_TR_SetAuth", Esys_TR_SetAuth(tpm.ctx(), tr, &auth));
         !status.ok()) {
       return status;
     }
   }
-  // A sealed key opens only in a policy session that meets its policy. That
-  // session is not bound: TPM2_PolicyAuthValue puts the password in its keys
-  // as binding would (tpm2-tss leaves it out of a bound policy session's
-  // HMAC, where the TPM takes it in), so the response is encrypted all the
-  // same.
-  const int pcr = tpm.options.sealPcr;
-  ESYS_TR bound = ESYS_TR_NONE;
-  if (Status status = StartSession(tpm, ESYS_TR_NONE, pcr >= 0 ? ESYS_TR_NONE : tr, &bound,
-                                   pcr >= 0 ? TPM2_SE_POLICY : TPM2_SE_HMAC);
-      !status.ok()) {
-    return status;
+  ESYS_TR started = ESYS_TR_NONE;
+  Status opened = StartUnsealSession(tpm, tr, &started);
+  TransientObject session(started != ESYS_TR_NONE ? tpm.Object(started) : EsysObject());
+  if (!opened.ok()) {
+    return opened;
   }
-  TransientObject session(tpm.Object(bound));
-  if (Status status = pcr >= 0 ? MeetVerdictPolicy(tpm, bound, pcr) : Status(); !status.ok()) {
-    return status;
-  }
+  const ESYS_TR bound = started;
   if (Status status =
           Check("Esys_TRSess_SetAttributes",
                 Esys_TRSess_SetAttributes(tpm.ctx(), bound, TPMA_SESSION_ENCRYPT, 0xff));

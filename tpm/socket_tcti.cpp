@@ -16,6 +16,7 @@
 #include <new>
 #include <string_view>
 
+#include "util/endian.h"
 #include "util/owned.h"
 
 namespace keymgr::tpm {
@@ -146,9 +147,7 @@ std::size_t ResponseSize(const SocketTcti& tcti) {
   if (tcti.have < kHeaderSize) {
     return kHeaderSize;
   }
-  const std::uint8_t* size = tcti.response.data() + 2;
-  return std::size_t{size[0]} << 24 | std::size_t{size[1]} << 16 | std::size_t{size[2]} << 8 |
-         size[3];
+  return LoadBig32(tcti.response.data() + 2);
 }
 
 TSS2_RC Receive(TSS2_TCTI_CONTEXT* context, size_t* size, uint8_t* response, int32_t timeout) {

@@ -13,6 +13,7 @@ inline constexpr std::size_t kPathBufferSize = 100;
 inline constexpr char kManifestPath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.list";
 inline constexpr char kDigestFilePath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.cb";
 inline constexpr char kSignaturePath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.sig";
+inline constexpr char kPolicyPath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.policy";
 inline constexpr char kBootLogPath[] = KEYMGR_ROOT "/quorvan/spool/log/keymgr.log";
 inline constexpr char kEventLogPath[] = KEYMGR_ROOT "/quorvan/spool/log/keymgr.events";
 inline constexpr char kScDigestPath[] = KEYMGR_ROOT "/quorvan/hidden/keymgr.cs";

@@ -1,12 +1,15 @@
 #include "support/tpm_settings.h"
 
+#include <vector>
+
 #include "keymgr_build_config.h"
 #include "tpm/connection.h"
 
 namespace {
 
 std::string g_transport = KEYMGR_TCTI;
-keymgr::tpm::Options g_options = {nullptr, KEYMGR_TPM_TIMEOUT_MS, KEYMGR_SEAL_PCR};
+keymgr::tpm::Options g_options = {nullptr, KEYMGR_TPM_TIMEOUT_MS, KEYMGR_SEAL_PCR, {}};
+std::vector<std::uint8_t> g_vendorKey;
 
 }  // namespace
 
@@ -31,8 +34,10 @@ void UseBuildTransport() {
   UseTransport(KEYMGR_TCTI, KEYMGR_TPM_TIMEOUT_MS);
 }
 
-void UseSealPcr(int pcr) {
+void UseSealPcr(int pcr, std::span<const std::uint8_t> vendorKey) {
   g_options.sealPcr = pcr;
+  g_vendorKey.assign(vendorKey.begin(), vendorKey.end());
+  g_options.vendorKey = g_vendorKey;
 }
 
 }  // namespace keymgr::test

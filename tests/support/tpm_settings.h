@@ -4,6 +4,8 @@
 // them; a connection already held keeps its own.
 #pragma once
 
+#include <cstdint>
+#include <span>
 #include <string>
 
 namespace keymgr::test {
@@ -14,9 +16,10 @@ namespace keymgr::test {
 void UseTransport(const std::string& tcti, int deadlineMs);
 // UseBuildTransport restores the build's transport and deadline.
 void UseBuildTransport();
-// UseSealPcr makes keys created from then on require PCR |pcr| at the good
-// boot verdict's value, as a build with KEYMGR_SEAL_TO_VERDICT does; -1 for
-// plain keys.
-void UseSealPcr(int pcr);
+// UseSealPcr makes keys created and opened from then on sealed to the boot
+// as a build with KEYMGR_SEAL_TO_VERDICT makes them: following the policies
+// that |vendorKey| (an RSA-2048 modulus) signs, with the verdict in PCR
+// |pcr|; -1 for plain keys.
+void UseSealPcr(int pcr, std::span<const std::uint8_t> vendorKey = {});
 
 }  // namespace keymgr::test
