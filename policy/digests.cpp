@@ -2,8 +2,6 @@
 
 #include <tss2/tss2_tpm2_types.h>
 
-#include <vector>
-
 #include "crypto/hash.h"
 #include "util/endian.h"
 
@@ -134,6 +132,20 @@ Name NvIndexName(std::uint32_t handle, std::uint32_t attributes, const Digest& a
                     .Sized(authPolicy)
                     .Big(dataSize)
                     .Final());
+}
+
+Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr, const Digest& goodPcr) {
+  if (!vendor.empty()) {
+    return PolicyAuthorize(RsaSigningKeyName(vendor), kCounterPolicyRef);
+  }
+  const Digest good[] = {goodPcr};
+  return PolicyCommandCode(PolicyPcr(Digest{}, PcrMask{1} << verdictPcr, PcrDigest(good)),
+                           TPM2_CC_NV_Increment);
+}
+
+Name CounterName(const Digest& counterPolicy, bool written) {
+  return NvIndexName(kCounterHandle, kCounterAttributes | (written ? kCounterWritten : 0),
+                     counterPolicy, kCounterSize);
 }
 
 }  // namespace keymgr::policy

@@ -52,4 +52,29 @@ Name RsaSigningKeyName(std::span<const std::uint8_t> modulus);
 Name NvIndexName(std::uint32_t handle, std::uint32_t attributes, const Digest& authPolicy,
                  std::uint16_t dataSize);
 
+// The policy references the two approvals are made for, so that neither
+// signature serves the other.
+inline constexpr std::array<std::uint8_t, 10> kKeyPolicyRef = {'k', 'e', 'y', 'm', 'g',
+                                                               'r', ' ', 'k', 'e', 'y'};
+inline constexpr std::array<std::uint8_t, 14> kCounterPolicyRef = {
+    'k', 'e', 'y', 'm', 'g', 'r', ' ', 'c', 'o', 'u', 'n', 't', 'e', 'r'};
+
+// The release counter: an 8-byte TPM_NT_COUNTER NV index in the owner range
+// (TCG's registry of handles: 0x01800000-0x01BFFFFF) that only a policy
+// session can move and anyone can read with its empty password.
+inline constexpr std::uint32_t kCounterHandle = 0x01800B0Eu;
+inline constexpr std::uint16_t kCounterSize = 8;
+// TPM_NT_COUNTER | POLICYWRITE | AUTHREAD | NO_DA; the TPM sets WRITTEN on
+// the first increment.
+inline constexpr std::uint32_t kCounterAttributes = 0x02040018u;
+inline constexpr std::uint32_t kCounterWritten = 0x20000000u;
+
+// CounterPolicy is the counter's authPolicy: the vendor's approval for the
+// counter when |vendor| (an RSA modulus) is given, else the good verdict
+// |goodPcr| in PCR |verdictPcr| for TPM2_NV_Increment.
+Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr, const Digest& goodPcr);
+
+// CounterName is the counter's name, |written| or not yet.
+Name CounterName(const Digest& counterPolicy, bool written);
+
 }  // namespace keymgr::policy

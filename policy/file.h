@@ -29,13 +29,6 @@ inline constexpr std::size_t kRsaSignatureSize = 256;
 inline constexpr std::size_t kPolicyFileSize = 84 + 2 * kRsaSignatureSize;
 inline constexpr std::uint32_t kPolicyFileVersion = 1;
 
-// The policy references the two approvals are made for, so that neither
-// signature serves the other.
-inline constexpr std::array<std::uint8_t, 10> kKeyPolicyRef = {'k', 'e', 'y', 'm', 'g',
-                                                               'r', ' ', 'k', 'e', 'y'};
-inline constexpr std::array<std::uint8_t, 14> kCounterPolicyRef = {
-    'k', 'e', 'y', 'm', 'g', 'r', ' ', 'c', 'o', 'u', 'n', 't', 'e', 'r'};
-
 using RsaSignature = std::array<std::uint8_t, kRsaSignatureSize>;
 
 struct PolicyFile {

@@ -15,9 +15,10 @@ namespace keymgr::tpm {
 
 namespace {
 
-constexpr TPMA_NV kCounterAttributes = (TPM2_NT_COUNTER << TPMA_NV_TPM2_NT_SHIFT) |
-                                       TPMA_NV_POLICYWRITE | TPMA_NV_AUTHREAD | TPMA_NV_NO_DA;
-constexpr std::uint16_t kCounterSize = 8;
+static_assert(policy::kCounterAttributes ==
+              ((TPM2_NT_COUNTER << TPMA_NV_TPM2_NT_SHIFT) | TPMA_NV_POLICYWRITE | TPMA_NV_AUTHREAD |
+               TPMA_NV_NO_DA));
+static_assert(policy::kCounterWritten == TPMA_NV_WRITTEN);
 
 // VendorPublic is the vendor's RSA key as the TPM loads it to verify its
 // signatures; its name is policy::RsaSigningKeyName of the modulus.
@@ -83,26 +84,18 @@ Status Approve(Connection& tpm, ESYS_TR session, std::span<const std::uint8_t> v
                          SizedOf<TPM2B_NAME>(policy::RsaSigningKeyName(vendor)), *ticket.get());
 }
 
-// CounterPolicy is the counter's authPolicy: the vendor's approval for the
-// counter, or else the good verdict in PCR |verdictPcr| for TPM2_NV_Increment.
+// CounterPolicy is the counter's authPolicy in this build.
 policy::Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr) {
-  if (!vendor.empty()) {
-    return policy::PolicyAuthorize(policy::RsaSigningKeyName(vendor), policy::kCounterPolicyRef);
-  }
-  const policy::Digest good[] = {verdict::GoodPcrValue()};
-  return policy::PolicyCommandCode(
-      policy::PolicyPcr(policy::Digest{}, policy::PcrMask{1} << verdictPcr,
-                        policy::PcrDigest(good)),
-      TPM2_CC_NV_Increment);
+  return policy::CounterPolicy(vendor, verdictPcr, verdict::GoodPcrValue());
 }
 
 TPM2B_NV_PUBLIC CounterPublic(std::span<const std::uint8_t> vendor, int verdictPcr) {
   TPM2B_NV_PUBLIC area{};
-  area.nvPublic.nvIndex = kCounterHandle;
+  area.nvPublic.nvIndex = policy::kCounterHandle;
   area.nvPublic.nameAlg = TPM2_ALG_SHA256;
-  area.nvPublic.attributes = kCounterAttributes;
+  area.nvPublic.attributes = policy::kCounterAttributes;
   area.nvPublic.authPolicy = SizedOf<TPM2B_DIGEST>(CounterPolicy(vendor, verdictPcr));
-  area.nvPublic.dataSize = kCounterSize;
+  area.nvPublic.dataSize = policy::kCounterSize;
   return area;
 }
 
@@ -118,7 +111,7 @@ Status OpenCounter(Connection& tpm, std::span<const std::uint8_t> vendor, int ve
                    Counter* counter) {
   const TPM2B_NV_PUBLIC area = CounterPublic(vendor, verdictPcr);
   ESYS_TR index = ESYS_TR_NONE;
-  if (!OpenPersistent(tpm, kCounterHandle, &index).ok()) {
+  if (!OpenPersistent(tpm, policy::kCounterHandle, &index).ok()) {
     if (tpm.broken) {
       return Refused("TPM connection lost");
     }
@@ -132,15 +125,14 @@ Status OpenCounter(Connection& tpm, std::span<const std::uint8_t> vendor, int ve
       !status.ok()) {
     return status;
   }
-  const policy::Digest& authPolicy = CounterPolicy(vendor, verdictPcr);
-  const auto is = [&](TPMA_NV attributes) {
-    const policy::Name expected =
-        policy::NvIndexName(kCounterHandle, attributes, authPolicy, kCounterSize);
+  const policy::Digest authPolicy = CounterPolicy(vendor, verdictPcr);
+  const auto is = [&](bool written) {
+    const policy::Name expected = policy::CounterName(authPolicy, written);
     return name.get()->size == expected.size() &&
            std::equal(expected.begin(), expected.end(), name.get()->name);
   };
-  counter->written = is(kCounterAttributes | TPMA_NV_WRITTEN);
-  return counter->written || is(kCounterAttributes)
+  counter->written = is(true);
+  return counter->written || is(false)
              ? Status()
              : Refused("another NV index at the release counter's handle");
 }
@@ -155,11 +147,11 @@ Status ReadCounter(Connection& tpm, const Counter& counter, std::uint64_t* value
   }
   Output<TPM2B_MAX_NV_BUFFER> data;
   if (Status status =
-          NvRead(tpm, counter.index.get().tr, tpm.session.get().tr, kCounterSize, &data);
+          NvRead(tpm, counter.index.get().tr, tpm.session.get().tr, policy::kCounterSize, &data);
       !status.ok()) {
     return status;
   }
-  if (data.get()->size != kCounterSize) {
+  if (data.get()->size != policy::kCounterSize) {
     return Refused("release counter size");
   }
   *value = LoadBig64(data.get()->buffer);
@@ -217,12 +209,12 @@ Status MeetKeyPolicy(Connection& tpm, ESYS_TR session, const policy::PolicyFile&
     return status;
   }
   ESYS_TR counter = ESYS_TR_NONE;
-  if (Status status = OpenPersistent(tpm, kCounterHandle, &counter); !status.ok()) {
+  if (Status status = OpenPersistent(tpm, policy::kCounterHandle, &counter); !status.ok()) {
     return status;
   }
   PersistentObject counterIndex(tpm.Object(counter));
   TPM2B_OPERAND release{};
-  release.size = kCounterSize;
+  release.size = policy::kCounterSize;
   StoreBig64(release.buffer, file.release);
   if (Status status = PolicyNV(tpm, session, counter, release, TPM2_EO_UNSIGNED_LE); !status.ok()) {
     return status;

@@ -12,10 +12,6 @@
 
 namespace keymgr::tpm {
 
-// The release counter's NV index, in the owner range (TCG's registry of
-// handles: 0x01800000-0x01BFFFFF): an 8-byte TPM_NT_COUNTER.
-inline constexpr TPM2_HANDLE kCounterHandle = 0x01800B0Eu;
-
 // UsePinnedParent makes the storage parent available (UseParent) and holds
 // its name against the pin in the EEPROM: a parent of another name, such as
 // one that something between this process and the TPM answers with, is
