@@ -11,6 +11,11 @@ namespace keymgr::verdict {
 
 namespace {
 
+// KindKey is the key of the content of an event of |kind|.
+std::string_view KindKey(EventKind kind) {
+  return kind == EventKind::kVerdict ? "{\"verdict\":\"" : "{\"separator\":\"";
+}
+
 // Writer and Reader walk a record's text through Layout, one writing it and
 // the other taking it apart, so that both follow the same layout. Each call
 // returns false when the line is full, or does not go on as the layout says.
@@ -37,7 +42,7 @@ struct Writer {
     return Literal({HexText(digest, HexCase::kLower).data(), 2 * digest.size()});
   }
   bool Value(Verdict verdict) { return Literal(VerdictName(verdict)); }
-  bool Value(EventKind /*kind*/) { return Literal("keymgr"); }
+  bool Value(EventKind kind) { return Literal(KindKey(kind)); }
   template <class T>
   bool Field(std::string_view key, const std::optional<T>& value, std::string_view end) {
     return !value || (Literal(key) && Value(*value) && Literal(end));
@@ -80,8 +85,13 @@ struct Reader {
     return false;
   }
   bool Value(EventKind& kind) {
-    kind = EventKind::kVerdict;
-    return Literal("keymgr");
+    for (const EventKind named : {EventKind::kVerdict, EventKind::kSeparator}) {
+      if (Literal(KindKey(named))) {
+        kind = named;
+        return true;
+      }
+    }
+    return false;
   }
   template <class T>
   bool Field(std::string_view key, std::optional<T>& value, std::string_view end) {
@@ -94,20 +104,44 @@ struct Reader {
 };
 
 // Layout is the record's text, field by field; |event| is an Event, const
-// for the Writer. The content after content_type is a verdict event's; an
-// event of another kind would lay out its own there.
+// for the Writer. The content's first key tells the event's kind, and a
+// verdict's fields follow it.
 template <class Io, class E>
 bool Layout(Io& io, E& event) {
-  return io.Literal("{\"recnum\":") && io.Value(event.recnum) && io.Literal(",\"pcr\":") &&
-         io.Value(event.pcr) && io.Literal(",\"digests\":[{\"hashAlg\":\"sha256\",\"digest\":\"") &&
-         io.Value(event.digest) && io.Literal("\"}],\"content_type\":\"") && io.Value(event.kind) &&
-         io.Literal("\",\"content\":{\"verdict\":\"") && io.Value(event.verdict) &&
-         io.Literal("\"") && io.Field(",\"manifest_sha256\":\"", event.manifestSha256, "\"") &&
+  if (!(io.Literal("{\"recnum\":") && io.Value(event.recnum) && io.Literal(",\"pcr\":") &&
+        io.Value(event.pcr) && io.Literal(",\"digests\":[{\"hashAlg\":\"sha256\",\"digest\":\"") &&
+        io.Value(event.digest) && io.Literal("\"}],\"content_type\":\"keymgr\",\"content\":") &&
+        io.Value(event.kind))) {
+    return false;
+  }
+  if (event.kind == EventKind::kSeparator) {
+    return io.Literal("proof\"}}");
+  }
+  return io.Value(event.verdict) && io.Literal("\"") &&
+         io.Field(",\"manifest_sha256\":\"", event.manifestSha256, "\"") &&
          io.Field(",\"digests_sha256\":\"", event.digestsSha256, "\"") &&
          io.Field(",\"release\":", event.release, "") && io.Literal("}}");
 }
 
 }  // namespace
+
+Event VerdictEvent(std::uint32_t recnum, std::uint32_t pcr, Verdict verdict) {
+  Event event;
+  event.recnum = recnum;
+  event.pcr = pcr;
+  event.digest = VerdictDigest(verdict);
+  event.verdict = verdict;
+  return event;
+}
+
+Event SeparatorEvent(std::uint32_t recnum, std::uint32_t pcr) {
+  Event event;
+  event.recnum = recnum;
+  event.pcr = pcr;
+  event.digest = SeparatorDigest();
+  event.kind = EventKind::kSeparator;
+  return event;
+}
 
 std::size_t EncodeEvent(const Event& event, std::span<char> line) {
   Writer out{line};

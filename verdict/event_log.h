@@ -14,9 +14,11 @@
 
 namespace keymgr::verdict {
 
-// What an event records, which gives its content's form. The boot verdict
-// is the one event logged so far.
-enum class EventKind : std::uint8_t { kVerdict };
+// What an event records, which gives its content's form: the boot verdict,
+// or the separator that the first key proof of a boot (or, in a signed build
+// without sealed keys, the boot run) extends after it, so that nothing later
+// in the boot finds the verdict's value in the PCR.
+enum class EventKind : std::uint8_t { kVerdict, kSeparator };
 
 struct Event {
   std::uint32_t recnum = 0;
@@ -24,7 +26,7 @@ struct Event {
   PcrValue digest{};  // what the PCR was extended with
   EventKind kind = EventKind::kVerdict;
   // The content of a verdict event: the verdict, and for a verifier what it
-  // was reached over.
+  // was reached over. A separator has none.
   Verdict verdict = Verdict::kNone;
   std::optional<PcrValue> manifestSha256;
   std::optional<PcrValue> digestsSha256;
@@ -32,6 +34,11 @@ struct Event {
 
   bool operator==(const Event&) const = default;
 };
+
+// VerdictEvent is the event of |verdict|, numbered |recnum|, in PCR |pcr|.
+Event VerdictEvent(std::uint32_t recnum, std::uint32_t pcr, Verdict verdict);
+// SeparatorEvent is the separator, numbered |recnum|, in PCR |pcr|.
+Event SeparatorEvent(std::uint32_t recnum, std::uint32_t pcr);
 
 // Room for the longest record.
 inline constexpr std::size_t kEventLineSize = 512;

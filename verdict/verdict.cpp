@@ -10,14 +10,26 @@ const char* VerdictName(Verdict verdict) {
   return verdict == Verdict::kOk ? "BN=OK" : verdict == Verdict::kFail ? "BN=FAIL" : "none";
 }
 
-PcrValue VerdictDigest(Verdict verdict) {
-  static constexpr char kPrefix[] = "keymgr boot verdict: ";
+namespace {
+
+// TextDigest is the SHA-256 of |prefix| and |text|.
+PcrValue TextDigest(const char* prefix, const char* text) {
   PcrValue digest{};
   crypto::Sha256 sha;
-  (void)sha.Update(kPrefix, sizeof(kPrefix) - 1);
-  (void)sha.Update(VerdictName(verdict), std::strlen(VerdictName(verdict)));
+  (void)sha.Update(prefix, std::strlen(prefix));
+  (void)sha.Update(text, std::strlen(text));
   (void)sha.Final(digest);
   return digest;
+}
+
+}  // namespace
+
+PcrValue VerdictDigest(Verdict verdict) {
+  return TextDigest("keymgr boot verdict: ", VerdictName(verdict));
+}
+
+PcrValue SeparatorDigest() {
+  return TextDigest("keymgr boot separator", "");
 }
 
 PcrValue Extended(const PcrValue& pcr, const PcrValue& digest) {

@@ -19,6 +19,10 @@ using PcrValue = std::array<std::uint8_t, crypto::kSha256Size>;
 // BN=FAIL, or "none" for a run that verified nothing.
 PcrValue VerdictDigest(Verdict verdict);
 
+// SeparatorDigest is the SHA-256 of "keymgr boot separator": the event that
+// closes the verdict PCR for the rest of a boot.
+PcrValue SeparatorDigest();
+
 // Extended is the value of a SHA-256 PCR at |pcr| once extended with
 // |digest|.
 PcrValue Extended(const PcrValue& pcr, const PcrValue& digest);

@@ -20,7 +20,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   if (verdict::DecodeEvent(input, &event).ok()) {
     Require(std::string_view(line.data(), verdict::EncodeEvent(event, line)) == input);
   }
-  // The record: recnum, pcr, verdict and which fields it has, release, then
+  // The record: recnum, pcr, verdict and which fields it has (or that it is a
+  // separator), release, then
   // the three digests; missing bytes are zeros.
   std::array<std::uint8_t, 18 + 3 * 32> bytes{};
   std::memcpy(bytes.data(), data, std::min(size, bytes.size()));
@@ -37,6 +38,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   if ((bytes[9] & 4) != 0) {
     made.release = keymgr::LoadBig64(bytes.data() + 10);
+  }
+  if ((bytes[9] & 8) != 0) {  // a separator carries no content beyond its kind
+    made = verdict::SeparatorEvent(made.recnum, made.pcr);
   }
   const std::size_t length = verdict::EncodeEvent(made, line);
   Require(length > 0 && verdict::DecodeEvent({line.data(), length}, &event).ok() && event == made);
