@@ -114,6 +114,7 @@ struct FaultRow {
   const char* name;
   Fault fault;
   int option;
+  int first = 1, last = 99;  // the commands to fail
 };
 using FailedCommands = TpmFlowRows<FaultRow>;
 TEST_P(FailedCommands, EndInTimeAndLeaveOneKey) {
@@ -122,7 +123,7 @@ TEST_P(FailedCommands, EndInTimeAndLeaveOneKey) {
   OnProxy bus;
   ASSERT_GE(KmmSeedRandom(), 0);  // seeded once, so each flow sends the same commands
   ASSERT_NE(Manage(KMM_OPTION_REGENERATE, &out), nullptr) << out;
-  for (int nth = 1;; ++nth) {
+  for (int nth = row.first; nth <= row.last; ++nth) {
     SCOPED_TRACE(testing::Message() << "command " << nth);
     bus.proxy.Arm(row.fault, nth);
     const KeyContext* context = Manage(row.option, &out);
@@ -156,7 +157,9 @@ TEST_P(FailedCommands, EndInTimeAndLeaveOneKey) {
   }
 }
 const FaultRow kFaults[] = {
-    {"regeneration unanswered", Fault::kWithhold, KMM_OPTION_REGENERATE},
+    {"regeneration unanswered at its first 8 commands", Fault::kWithhold, KMM_OPTION_REGENERATE, 1,
+     8},
+    {"regeneration unanswered at a later command", Fault::kWithhold, KMM_OPTION_REGENERATE, 9},
     {"regeneration answered with an error", Fault::kError, KMM_OPTION_REGENERATE},
     {"regeneration hung up on", Fault::kHangUp, KMM_OPTION_REGENERATE},
     {"boot unanswered", Fault::kWithhold, KMM_OPTION_NORMAL_BOOT},
