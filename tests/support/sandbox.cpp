@@ -164,4 +164,10 @@ std::string TpmLeftovers() {
   return left;
 }
 
+void FlushTpm() {
+  for (const char* kind : {"-t", "-l", "-s"}) {
+    Tpm2({"tpm2_flushcontext", kind});
+  }
+}
+
 }  // namespace keymgr::test

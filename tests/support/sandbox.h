@@ -69,16 +69,18 @@ void EvictAllBut(const std::set<std::string>& keep);
 
 // TpmLeftovers lists the transient objects and the loaded and saved sessions
 // that the suite's swtpm holds: "" when every flow flushed what it loaded
-// (the simulator has no resource manager to do it).
+// (the simulator has no resource manager to do it). FlushTpm flushes them.
 std::string TpmLeftovers();
+void FlushTpm();
 
 // TpmClean, a member of a TPM test's fixture, expects the test to leave no
-// transient object or session behind, and evicts the persistent handles
-// that the test made.
+// transient object or session behind, and then clears the TPM for the next
+// test: flushes what was left and evicts the persistent handles it made.
 struct TpmClean {
   const std::set<std::string> keep = PersistentHandles();
   ~TpmClean() {
     EXPECT_EQ(TpmLeftovers(), "");
+    FlushTpm();
     EvictAllBut(keep);
   }
 };
