@@ -141,9 +141,9 @@ TEST_P(FailedCommands, EndInTimeAndLeaveOneKey) {
     FlushTpm();
     if (row.option == KMM_OPTION_REGENERATE) {
       // A deadline of its own: key generation may outlast the short one.
-      UseTransport("swtpm:path=" KEYMGR_ROOT "/run/proxy.sock", 30000);
+      bus.Deadline(30000);
       ASSERT_NE(KeyManage(KMM_OPTION_REGENERATE, 0), nullptr);
-      UseTransport("swtpm:path=" KEYMGR_ROOT "/run/proxy.sock", kDeadlineMs);
+      bus.Deadline(kDeadlineMs);
       auto own = PersistentHandles();
       std::erase_if(own, [&](const std::string& h) { return clean_.keep.count(h) != 0; });
       EXPECT_EQ(own.size(), 1u);

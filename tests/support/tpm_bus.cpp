@@ -9,13 +9,20 @@
 namespace keymgr::test {
 
 const std::string kSwtpm = std::string(KEYMGR_TCTI).substr(std::strlen("swtpm:path="));
+namespace {
 const std::string kProxy = KEYMGR_ROOT "/run/proxy.sock";
+}  // namespace
 
 // tpm2-tss's own transport also opens the simulator's control socket.
-OnProxy::OnProxy(const std::string& module) : proxy(kProxy, kSwtpm) {
+OnProxy::OnProxy(const std::string& module)
+    : proxy(kProxy, kSwtpm), tcti(module + ":path=" + kProxy) {
   std::filesystem::remove(kProxy + ".ctrl");
   std::filesystem::create_symlink(kSwtpm + ".ctrl", kProxy + ".ctrl");
-  UseTransport(module + ":path=" + kProxy, kDeadlineMs);
+  Deadline(kDeadlineMs);
+}
+
+void OnProxy::Deadline(int ms) const {
+  UseTransport(tcti, ms);
 }
 
 OnProxy::~OnProxy() {

@@ -22,9 +22,10 @@ constexpr int kDeadlineMs = 1500;
 struct OnProxy {
   explicit OnProxy(const std::string& module = "swtpm");
   ~OnProxy();
-  OnProxy(const OnProxy&) = delete;
-  OnProxy& operator=(const OnProxy&) = delete;
+  // Deadline gives each command |ms| from now on (kDeadlineMs at first).
+  void Deadline(int ms) const;
   TpmProxy proxy;
+  const std::string tcti;
 };
 
 // What a flow costs a discrete TPM: its commands, and the asymmetric
