@@ -4,8 +4,10 @@
 
 #include <cstring>
 #include <tuple>
+#include <utility>
 
 #include "crypto/hash.h"
+#include "keymgr_build_config.h"
 #include "support/files.h"
 
 namespace {
@@ -46,16 +48,38 @@ uint32_t Job(uint32_t op, const ProtectedKey* in, uint32_t n, ProtectedKey* out,
   return rc;
 }
 
-// Constant 1 is the AES key as the module binds it to a one-off key;
-// unbound, it seals nothing. (Bound, it seals and unseals the store key in
-// every regeneration and boot of the flow tests.)
-TEST(Dtc, TheKeyConstantSealsNothingUnbound) {
-  ProtectedKey *key = nullptr, *iv = nullptr;
-  uint32_t len = 0;
-  EXPECT_EQ(VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &key, &len), 0u);
-  EXPECT_EQ(VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &iv, &len), 0u);
-  Slot plain(Bytes(32, 'a')), sealed;
+// The built-in constants as release 2.3 has them, which every later build
+// must keep to open the key material that devices hold: constant 1 the
+// 32-byte slot of the one-off key, bound to nothing until the module binds
+// it; constant 2 the IV, pinned with an encipherment under it; constant 3
+// the disk-mapper tool's digest that the build was given.
+TEST(Dtc, BuiltInConstantsAreRelease23s) {
+  ProtectedKey *key = nullptr, *iv = nullptr, *dmsetup = nullptr;
+  uint32_t keyLength = 0, ivLength = 0, dmsetupLength = 0;
+  ASSERT_EQ(VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &key, &keyLength), 0u);
+  ASSERT_EQ(VKT_DTC_GetConstant(DTC_CONST_AES_PARAM, &iv, &ivLength), 0u);
+  ASSERT_EQ(VKT_DTC_GetConstant(DTC_CONST_DMSETUP_DIGEST, &dmsetup, &dmsetupLength), 0u);
+  EXPECT_EQ(keyLength, 32u);
+  EXPECT_EQ(Read(iv, ivLength), FromHex("34055aba7572c461318b84e9206148c7"));
+  EXPECT_EQ(Read(dmsetup, dmsetupLength), FromHex(KEYMGR_DMSETUP_SHA256));
+  for (uint32_t index : {0u, 4u}) {
+    EXPECT_EQ(VKT_DTC_GetConstant(index, &key, &keyLength), DTC_E_BAD_SELECTOR);
+    EXPECT_EQ(key, nullptr);
+  }
+  ASSERT_EQ(VKT_DTC_GetConstant(DTC_CONST_AES_KEY, &key, &keyLength), 0u);
+  Slot plain(
+      FromHex("6bc1bee22e409f96e93d7e117393172aae2d8a571e03ac9c9eb76fac45af8e51"
+              "30c81c46a35ce411e5fbc1191a0a52ef")),
+      sealed;
+  uint32_t len = 64;
   EXPECT_EQ(Job(DTC_AES_ENCRYPT, &plain.pk, 48, &sealed.pk, &len, key, iv), DTC_E_KEY_NOT_BOUND);
+  Slot bound(FromHex("603deb1015ca71be2b73aef0857d77811f352c073b6108d72d9810a30914dff4"));
+  ASSERT_EQ(Job(DTC_AES_ENCRYPT, &plain.pk, 48, &sealed.pk, &len, &bound.pk, iv), 0u);
+  EXPECT_EQ(Read(&sealed.pk, len), FromHex("ae1b631f0b8b22956aba1eada5a249551bbc7448497ad15f"
+                                           "6c8ee8e81904631ea49b76ff2342ae32d5c25b85ef455b0a"));
+  // The fixed constants cannot be re-bound or written.
+  EXPECT_EQ(ProtectedKey_Attach(iv, 0, sealed.bytes), DTC_E_BAD_STATE);
+  EXPECT_EQ(Job(DTC_HASH_SELECTOR, &plain.pk, 48, dmsetup, &len), DTC_E_BAD_STATE);
 }
 
 TEST(Crypto, PublishedVectorsAndMaskedRecords) {
@@ -101,27 +125,33 @@ TEST(Crypto, PublishedVectorsAndMaskedRecords) {
   }
   EXPECT_NE(std::memcmp(a.bytes, b.bytes, 64), 0) << "equal keys must not share a mask";
 
-  // And refuses what no caller may ask, writing nothing.
+  // And refuses what no caller may ask with its code, writing nothing.
   const Bytes untouched(reinterpret_cast<char*>(b.bytes), 64);
   uint32_t small = 31, len = 32;
-  EXPECT_NE(Job(DTC_HASH_SELECTOR, &a.pk, 48, &b.pk, &small), 0u);
-  EXPECT_NE(Job(DTC_HASH_SELECTOR + 1, &a.pk, 48, &b.pk, &len), 0u);
-  EXPECT_NE(VKT_DTC_GetHash(nullptr, DTC_HASH_SELECTOR, &a.pk, 48, &b.pk, &len), 0u);
-  EXPECT_NE(Job(1111, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk), 0u);
-  EXPECT_NE(Job(DTC_AES_ENCRYPT, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk, 32, 1205), 0u);
-  EXPECT_NE(Job(DTC_AES_ENCRYPT, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk, 16), 0u);
-  for (uint32_t n : {0u, 47u, 4096u}) {
-    EXPECT_NE(Job(DTC_AES_ENCRYPT, &a.pk, n, &b.pk, &len, &key.pk, &iv.pk), 0u) << n;
-  }
-  EXPECT_NE(ProtectedKey_Attach(&b.pk, 1, b.bytes), 0u);
-  // One run per set-up: a run before it or a second one is refused.
-  Slot once;
   CryptoContainer c = VKT_DTC_CreateCryptoContainer();
-  EXPECT_NE(VKT_DTC_AES_Process(c, &a.pk, 48, &b.pk, &len), 0u);
-  ASSERT_EQ(VKT_DTC_AES_Init(c, DTC_AES_ENCRYPT, DTC_AES_MODE, &key.pk, 32, &iv.pk), 0u);
-  EXPECT_EQ(VKT_DTC_AES_Process(c, &a.pk, 16, &once.pk, &len), 0u);
-  EXPECT_NE(VKT_DTC_AES_Process(c, &a.pk, 48, &b.pk, &len), 0u);
-  EXPECT_EQ(VKT_DTC_DestroyCryptoContainer(c), 0u);
+  const uint32_t early = VKT_DTC_AES_Process(c, &a.pk, 48, &b.pk, &len);
+  Slot once;  // one run per set-up
+  const uint32_t init = VKT_DTC_AES_Init(c, DTC_AES_ENCRYPT, DTC_AES_MODE, &key.pk, 32, &iv.pk);
+  const uint32_t first = VKT_DTC_AES_Process(c, &a.pk, 16, &once.pk, &len);
+  const std::pair<uint32_t, uint32_t> refusals[] = {
+      {Job(DTC_HASH_SELECTOR, &a.pk, 48, &b.pk, &small), DTC_E_SMALL_OUTPUT},
+      {Job(DTC_HASH_SELECTOR + 1, &a.pk, 48, &b.pk, &len), DTC_E_BAD_SELECTOR},
+      {VKT_DTC_GetHash(nullptr, DTC_HASH_SELECTOR, &a.pk, 48, &b.pk, &len), DTC_E_NULL_ARGUMENT},
+      {Job(1111, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk), DTC_E_BAD_SELECTOR},
+      {Job(DTC_AES_ENCRYPT, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk, 32, 1205), DTC_E_BAD_SELECTOR},
+      {Job(DTC_AES_ENCRYPT, &a.pk, 48, &b.pk, &len, &key.pk, &iv.pk, 16), DTC_E_BAD_LENGTH},
+      {Job(DTC_AES_ENCRYPT, &a.pk, 0, &b.pk, &len, &key.pk, &iv.pk), DTC_E_BAD_LENGTH},
+      {Job(DTC_AES_ENCRYPT, &a.pk, 47, &b.pk, &len, &key.pk, &iv.pk), DTC_E_BAD_LENGTH},
+      {Job(DTC_AES_ENCRYPT, &a.pk, 4096, &b.pk, &len, &key.pk, &iv.pk), DTC_E_BAD_LENGTH},
+      {ProtectedKey_Attach(&b.pk, 1, b.bytes), DTC_E_BAD_SELECTOR},
+      {early, DTC_E_BAD_STATE},
+      {init | first, 0},
+      {VKT_DTC_AES_Process(c, &a.pk, 48, &b.pk, &len), DTC_E_BAD_STATE},
+      {VKT_DTC_DestroyCryptoContainer(c), 0},
+  };
+  for (std::size_t i = 0; i < std::size(refusals); ++i) {
+    EXPECT_EQ(refusals[i].first, refusals[i].second) << "refusal " << i;
+  }
   EXPECT_EQ(Bytes(reinterpret_cast<char*>(b.bytes), 64), untouched);
 }
 

@@ -159,85 +159,91 @@ TEST(KmmFlow, RegenerationIsProvedAtBoot) {
   EXPECT_TRUE(std::all_of(bytes, bytes + sizeof(KeyContext), [](auto b) { return b == 0; }));
 }
 
-TEST(KmmFlow, FaultsAreReportedAndLeaveWhatWasStored) {
-  const std::string kSecret = "Generate Secret Key Error!!!\nRegenerate Key Error!!\n";
-  const std::string kDigest = "Generate Message Digest Error!!!\nRegenerate Key Error!!\n";
-  const std::string kStore = "Generate Store Key Error!!!\nRegenerate Key Error!!\n";
-  const std::string kUnseal = "Decrypt Store Key Error!!\n" + kFail;
-  const std::string kRead =
-      "Read Error [-5] - Store Key from EEPROM !!!\nRead Store Key error [Retry:";
-  const std::string kValues = "Read Store Key but values are error [Retry:";
-  const auto retries = [](const std::string& line) {
-    return line + "2]!!!\n" + line + "1]!!!\n" + line + "0]!!!\n";
-  };
-  const auto crypto = [](int call, int at, std::uint32_t code, std::uint32_t length = 0) {
-    return [=] { g_fault = {call, at, code, length}; };
-  };
-  const auto part = [](std::uint32_t begin, std::uint32_t end, int count) {
-    return [=] { Eeprom().fault = {begin, end, count}; };
-  };
-  const auto flip = [](std::uint32_t at) { return [=] { g_image[at] ^= 1; }; };
-  const auto pcp = [](PcpOp op, unsigned calls = 1) {
-    return [=] { KeyManager().fail[op] = calls; };
-  };
-  const std::uint32_t kDigestEnd = kScDigestOffset + kScDigestLength;
-  const std::uint32_t kLast = kStoreKeyOffset + kStoreKeyLength - 1;
-  // What a regeneration leaves (see State): nothing, the digest, or also the
-  // key files. A key whose identity never reached the disk is evicted again.
-  const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
-  const std::string kFiles = "- set 32 20 20 284 1";
-  struct Row {
-    const char* name;
-    int option;  // regenerations start from nothing, boots from a regeneration
-    std::function<void()> arm;
-    std::string out;    // part of stdout
-    std::string after;  // State() after a regeneration, the boot status log after a boot
-  } rows[] = {
-      // clang-format off
-      {"no container for the secret key", 3, crypto(kCreate, 1, 0), "Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {"secret key hash fails", 3, crypto(kHash, 1, 0xD7C00007), "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
-      {"secret key hash of 33 bytes", 3, crypto(kHash, 1, 0, 33), "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
-      {"no container for the digest", 3, crypto(kCreate, 2, 0), "Failed. nRes=0x00000000\n" + kDigest, kNone},
-      {"digest not written to EEPROM", 3, part(kScDigestOffset, kDigestEnd, 1), "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
-      // A draw that fails stops the regeneration: nothing is sealed under the
-      // built-in initial one-off key, a previous identity or zeros.
-      {"one-off key not drawn", 3, pcp(kRandom), "Failed to generate one_off_key by TPM.\n" + kStore, kDigestOnly},
-      {"password not drawn", 3, pcp(kRandom, 0b100), "name_hex.\nFailed to generate user_pass_hex.\n" + kStore, kDigestOnly},
-      {"TPM key not created", 3, pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
-      {"one-off key not sealed", 3, pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
-      {"identity file not replaced", 3, [] { fs::create_directory(kKeyIdPath); }, "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
-      {"password file not replaced", 3, [] { fs::create_directory(kKeyPwdPath); }, "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
-      {"no container for sealing", 3, crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
-      {"sealing gives 32 bytes", 3, crypto(kAesProcess, 1, 0, 32), "ook\nDTC_AES Failed.\n" + kStore, kFiles},
-      {"store key not written", 3, part(kLast, kLast + 1, 1), "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
-      {"store key read once in vain", 1, part(kLast, kLast + 1, 1), kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
-      {"store key never read", 1, part(kStoreKeyOffset, kStoreKeyOffset + 1, 3), retries(kRead) + kFail, "DT=FAIL\n"},
-      {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); }, retries(kValues) + "Normal Boot", "-"},
-      {"one-off key not unsealed", 1, pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
-      {"digest in EEPROM altered", 1, flip(kScDigestOffset + 5), "SC Digest Test Fail [EEPROM]!!\n" + kFail, "DT=FAIL\n"},
-      {"digest copy altered", 1, [] { WriteFile(kScDigestPath, std::string(32, 'x')); }, "Success [EEPROM]!!\nSC Digest Test Fail [HDD]!!\n" + kFail, "DT=FAIL\n"},
-      {"store key altered", 1, flip(kStoreKeyOffset + 20), "ST Key is decrypted!!\nSC Digest is created!!\nSC Digest Test Fail", "DT=FAIL\n"},
-      {"no container for unsealing", 1, crypto(kCreate, 1, 0), "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
-      {"unsealing gives 47 bytes", 1, crypto(kAesProcess, 1, 0, 47), "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
-      // clang-format on
-  };
-  ASSERT_GE(KmmSeedRandom(), 0);  // as a host does, so no row's draw goes to seeding
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.name);
-    Reset();
-    if (row.option == KMM_OPTION_NORMAL_BOOT) {
-      ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
-      g_calls = {};
-    }
-    row.arm();
-    const std::string out =
-        Call(row.option, row.after != "-");  // a boot expecting no log: logFlag 0
-    EXPECT_NE(out.find(row.out), std::string::npos) << out;
-    EXPECT_EQ(g_context == nullptr, out.ends_with("Error!!\n"));  // every failure ends so
-    EXPECT_EQ(row.option == KMM_OPTION_REGENERATE ? State() : Text(kBootLogPath), row.after);
-    EXPECT_EQ(g_live, 0);
-  }
+// A fault at each step: regenerations start from nothing, boots from a
+// regeneration. Each is reported with its lines, every failure ends with an
+// error line, and what was stored stays (see State). No container is left.
+const std::string kSecret = "Generate Secret Key Error!!!\nRegenerate Key Error!!\n";
+const std::string kDigest = "Generate Message Digest Error!!!\nRegenerate Key Error!!\n";
+const std::string kStore = "Generate Store Key Error!!!\nRegenerate Key Error!!\n";
+const std::string kUnseal = "Decrypt Store Key Error!!\n" + kFail;
+const std::string kRead =
+    "Read Error [-5] - Store Key from EEPROM !!!\nRead Store Key error [Retry:";
+const std::string kValues = "Read Store Key but values are error [Retry:";
+std::string Retries(const std::string& line) {
+  return line + "2]!!!\n" + line + "1]!!!\n" + line + "0]!!!\n";
 }
+std::function<void()> Crypto(int call, int at, std::uint32_t code, std::uint32_t length = 0) {
+  return [=] { g_fault = {call, at, code, length}; };
+}
+std::function<void()> Part(std::uint32_t begin, std::uint32_t end, int count) {
+  return [=] { Eeprom().fault = {begin, end, count}; };
+}
+std::function<void()> Flip(std::uint32_t at) {
+  return [=] { g_image[at] ^= 1; };
+}
+std::function<void()> Pcp(PcpOp op, unsigned calls = 1) {
+  return [=] { KeyManager().fail[op] = calls; };
+}
+constexpr std::uint32_t kDigestEnd = kScDigestOffset + kScDigestLength;
+constexpr std::uint32_t kLast = kStoreKeyOffset + kStoreKeyLength - 1;
+// What a regeneration leaves: nothing, the digest, or also the key files. A
+// key whose identity never reached the disk is evicted again.
+const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
+const std::string kFiles = "- set 32 20 20 284 1";
+
+struct Row {
+  const char* name;
+  int option;
+  std::function<void()> arm;
+  std::string out;    // part of stdout
+  std::string after;  // State() after a regeneration, the boot status log after a boot
+};
+class Faults : public testing::TestWithParam<Row> {};
+TEST_P(Faults, AreReportedAndLeaveWhatWasStored) {
+  const Row& row = GetParam();
+  ASSERT_GE(KmmSeedRandom(), 0);  // as a host does, so no draw of the row goes to seeding
+  Reset();
+  if (row.option == KMM_OPTION_NORMAL_BOOT) {
+    ASSERT_EQ(Call(KMM_OPTION_REGENERATE), kRegenerated);
+    g_calls = {};
+  }
+  row.arm();
+  const std::string out = Call(row.option, row.after != "-");  // a boot expecting no log: logFlag 0
+  EXPECT_NE(out.find(row.out), std::string::npos) << out;
+  EXPECT_EQ(g_context == nullptr, out.ends_with("Error!!\n"));  // every failure ends so
+  EXPECT_EQ(row.option == KMM_OPTION_REGENERATE ? State() : Text(kBootLogPath), row.after);
+  EXPECT_EQ(g_live, 0);
+}
+const Row kRows[] = {
+    // clang-format off
+    {"no container for the secret key", 3, Crypto(kCreate, 1, 0), "Failed. nRes=0x00000000\n" + kSecret, kNone},
+    {"secret key hash fails", 3, Crypto(kHash, 1, 0xD7C00007), "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
+    {"secret key hash of 33 bytes", 3, Crypto(kHash, 1, 0, 33), "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
+    {"no container for the digest", 3, Crypto(kCreate, 2, 0), "Failed. nRes=0x00000000\n" + kDigest, kNone},
+    {"digest not written to EEPROM", 3, Part(kScDigestOffset, kDigestEnd, 1), "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
+    // A draw that fails stops the regeneration: nothing is sealed under the
+    // built-in initial one-off key, a previous identity or zeros.
+    {"one-off key not drawn", 3, Pcp(kRandom), "Failed to generate one_off_key by TPM.\n" + kStore, kDigestOnly},
+    {"password not drawn", 3, Pcp(kRandom, 0b100), "name_hex.\nFailed to generate user_pass_hex.\n" + kStore, kDigestOnly},
+    {"TPM key not created", 3, Pcp(kCreateKey), "pass_hex.\nFailed to create OOK.\n" + kStore, kDigestOnly},
+    {"one-off key not sealed", 3, Pcp(kEncrypt), "OOK.\nFailed to encrypt Stored-OOK.\n" + kStore, kDigestOnly},
+    {"identity file not replaced", 3, [] { fs::create_directory(kKeyIdPath); }, "Stored-OOK.\nFailed to open keymgr.hddkeyid\n" + kStore, "- set 32 - - - 0"},
+    {"password file not replaced", 3, [] { fs::create_directory(kKeyPwdPath); }, "keymgr.hddkeyid\nFailed to open keymgr.hddpwd\n" + kStore, "- set 32 20 - - 1"},
+    {"no container for sealing", 3, Crypto(kCreate, 3, 0), "ook\nVKT_DTC_CreateCryptoContainer Failed.\n" + kStore, kFiles},
+    {"sealing gives 32 bytes", 3, Crypto(kAesProcess, 1, 0, 32), "ook\nDTC_AES Failed.\n" + kStore, kFiles},
+    {"store key not written", 3, Part(kLast, kLast + 1, 1), "Store Key to EEPROM !!!\nWrite Store Key Error!!!\n", kFiles},
+    {"store key read once in vain", 1, Part(kLast, kLast + 1, 1), kRead + "2]!!!\nSuccessed to open keymgr.ook\n", "DT=OK\n"},
+    {"store key never read", 1, Part(kStoreKeyOffset, kStoreKeyOffset + 1, 3), Retries(kRead) + kFail, "DT=FAIL\n"},
+    {"store key blank", 1, [] { std::fill_n(&g_image[kStoreKeyOffset], 2, 0); }, Retries(kValues) + "Normal Boot", "-"},
+    {"one-off key not unsealed", 1, Pcp(kDecrypt), "Failed to decrypt OOK.\n", "DT=FAIL\n"},
+    {"digest in EEPROM altered", 1, Flip(kScDigestOffset + 5), "SC Digest Test Fail [EEPROM]!!\n" + kFail, "DT=FAIL\n"},
+    {"digest copy altered", 1, [] { WriteFile(kScDigestPath, std::string(32, 'x')); }, "Success [EEPROM]!!\nSC Digest Test Fail [HDD]!!\n" + kFail, "DT=FAIL\n"},
+    {"store key altered", 1, Flip(kStoreKeyOffset + 20), "ST Key is decrypted!!\nSC Digest is created!!\nSC Digest Test Fail", "DT=FAIL\n"},
+    {"no container for unsealing", 1, Crypto(kCreate, 1, 0), "VKT_DTC_CreateCryptoContainer Failed.\n" + kUnseal, "DT=FAIL\n"},
+    {"unsealing gives 47 bytes", 1, Crypto(kAesProcess, 1, 0, 47), "DTC_AES Failed.\n" + kUnseal, "DT=FAIL\n"},
+    // clang-format on
+};
+INSTANTIATE_TEST_SUITE_P(Rows, Faults, testing::ValuesIn(kRows), RowName());
 
 // SeedGuess tells how random() was seeded when it gave the eight words of
 // the seed key in |context| (after its date and time), if it was seeded a

@@ -84,6 +84,9 @@ void pcp_release_connection(void) {}
 int pcp_persist_srk(void) {
   return 0;
 }
+int pcp_extend_pcr(uint32_t, const uint8_t*) {
+  return 0;
+}
 int pcp_getEntropyBytes(uint32_t count, uint8_t* dst, uint32_t* drawn) {
   *drawn = count < 32 ? count : 32;
   return pcp_getRandomBytes(*drawn, dst);

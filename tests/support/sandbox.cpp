@@ -155,4 +155,19 @@ void EvictAllBut(const std::set<std::string>& keep) {
   }
 }
 
+std::string TpmLeftovers() {
+  std::string left;
+  for (const char* kind :
+       {"handles-transient", "handles-loaded-session", "handles-saved-session"}) {
+    left += Tpm2({"tpm2_getcap", kind}).out;
+  }
+  return left;
+}
+
+void FlushTpm() {
+  for (const char* kind : {"-t", "-l", "-s"}) {
+    Tpm2({"tpm2_flushcontext", kind});
+  }
+}
+
 }  // namespace keymgr::test

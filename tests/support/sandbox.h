@@ -2,6 +2,9 @@
 // persistent handles, captured output and running the built programs.
 #pragma once
 
+#include <gtest/gtest.h>
+
+#include <cctype>
 #include <cstdint>
 #include <functional>
 #include <set>
@@ -63,5 +66,41 @@ RunResult Tpm2(std::vector<std::string> argv);
 // tpm2_getcap sees them. EvictAllBut evicts every one that is not in |keep|.
 std::set<std::string> PersistentHandles();
 void EvictAllBut(const std::set<std::string>& keep);
+
+// TpmLeftovers lists the transient objects and the loaded and saved sessions
+// that the suite's swtpm holds: "" when every flow flushed what it loaded
+// (the simulator has no resource manager to do it). FlushTpm flushes them.
+std::string TpmLeftovers();
+void FlushTpm();
+
+// TpmClean, a member of a TPM test's fixture, expects the test to leave no
+// transient object or session behind, and then clears the TPM for the next
+// test: flushes what was left and evicts the persistent handles it made.
+struct TpmClean {
+  const std::set<std::string> keep = PersistentHandles();
+  ~TpmClean() {
+    EXPECT_EQ(TpmLeftovers(), "");
+    FlushTpm();
+    EvictAllBut(keep);
+  }
+};
+
+// RowName names each row of a parameterized suite after its |name| (letters
+// and digits kept, any other run an underscore), so that ctest -R runs one:
+// INSTANTIATE_TEST_SUITE_P(Rows, Suite, testing::ValuesIn(kRows), RowName()).
+struct RowName {
+  template <class Row>
+  std::string operator()(const testing::TestParamInfo<Row>& info) const {
+    std::string id;
+    for (const char c : std::string_view(info.param.name)) {
+      if (std::isalnum(static_cast<unsigned char>(c)) != 0) {
+        id += c;
+      } else if (!id.empty() && id.back() != '_') {
+        id += '_';
+      }
+    }
+    return id;
+  }
+};
 
 }  // namespace keymgr::test

@@ -2,6 +2,7 @@
 // services and the real key manager on the suite's swtpm. Each run is a new
 // process, as at boot.
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -29,14 +30,16 @@ using namespace eeprom;
 
 const std::string K = KEYMGR_TEST_KEYMGR_BIN, H = KEYMGR_TEST_KMM_HOST_BIN;
 const std::string kOn = "SFE_003 - [4]\n", kDtFail = kOn + "DT=FAIL\nNormal Boot Error!!\n";
+// A log left by an earlier boot, longer than a line that replaces it.
+const std::string kOld = "OLD " + std::string(40, '.') + "\n";
 
 // Each test starts from an empty sandbox and a blank EEPROM with SFE_003 on
-// (so that boots log their DT line), and evicts the TPM keys it made.
+// (so that boots log their DT line), evicts the TPM keys it made, and leaves
+// no transient object or session in the TPM.
 class KmmHostE2e : public testing::Test {
  protected:
   void SetUp() override { ResetDevice(0xFF, 4); }
-  void TearDown() override { EvictAllBut(keep_); }
-  const std::set<std::string> keep_ = PersistentHandles();
+  const TpmClean clean_;
 };
 
 // Regenerated under umask 000 with a symbolic link planted at keymgr.hddpwd,
@@ -54,7 +57,7 @@ TEST_F(KmmHostE2e, RegenerationIsProvedAtBootAndAWrongPasswordFails) {
                     pwd = *ReadFile(kKeyPwdPath);
   EXPECT_EQ(cs, image.substr(kScDigestOffset, kScDigestLength));
   EXPECT_EQ(ReadFile(kKeyIdPath)->size() + pwd.size() + ReadFile(kStoredOokPath)->size(), 324u);
-  EXPECT_EQ(PersistentHandles().size(), keep_.size() + 1) << "one key of its own";
+  EXPECT_EQ(PersistentHandles().size(), clean_.keep.size() + 1) << "one key of its own";
   for (const char* path : {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath}) {
     struct stat st {};
     ASSERT_EQ(lstat(path, &st), 0) << path;
@@ -94,14 +97,21 @@ TEST_F(KmmHostE2e, RegenerationIsProvedAtBootAndAWrongPasswordFails) {
 // path: every run ends by itself at once, with the exit status, lines and log
 // of a file that cannot be opened. A file the programs replace is replaced
 // whatever stands at its path, except a folder, which fails that step.
-TEST_F(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
-  const std::string gone = InRoot("/gone");
+struct Kind {
+  const char* name;
+  int error;  // what a read of it fails with
+  void (*plant)(const std::string& path);
+};
+const std::string kGone = InRoot("/gone");
+class HostileFiles : public KmmHostE2e, public testing::WithParamInterface<Kind> {};
+TEST_P(HostileFiles, FailLikeUnopenableOnes) {
+  const Kind& kind = GetParam();
   WriteFile(InRoot("/d/a"), "a");
   WriteFile(kManifestPath, InRoot("/d/a") + "\n");
   WriteFile(kDmsetupPath, *ReadFile(KEYMGR_TEST_SOURCE_DIR "/tests/kmm/data/dmsetup"));
   ASSERT_EQ(test::Run({H, "dmsetup"}).status, 0);  // test builds expect the sample tool
   ASSERT_EQ(test::Run({K, "hash"}).status, 0);
-  std::map<std::string, std::string> healthy = {{kBootLogPath, "OLD\n"}};
+  std::map<std::string, std::string> healthy = {{kBootLogPath, kOld}};
   const auto restore = [&] {
     for (const auto& [path, bytes] : healthy) {
       fs::remove_all(path);
@@ -117,75 +127,83 @@ TEST_F(KmmHostE2e, HostileFilesAtFixedPathsFailLikeUnopenableOnes) {
   ASSERT_EQ(test::Run({H, "3"}).status, 0);
   snapshot();
 
+  const bool folder = kind.error == EISDIR;
+  const std::string e = std::to_string(kind.error);
+  // A key file that cannot be replaced fails the regeneration at its step.
+  const auto written = [&](const char* name) {
+    return folder ? std::string("Failed to open ") + name + "\nGenerate Store Key Error!!!\n"
+                  : std::string("Successed to open ") + name + "\n";
+  };
   const struct {
     const char* name;
-    int error;  // what a read of it fails with
-    std::function<void(const std::string&)> plant;
-  } kinds[] = {
-      {"FIFO", EINVAL, [](const std::string& p) { mkfifo(p.c_str(), 0600); }},
-      {"folder", EISDIR, [](const std::string& p) { fs::create_directory(p); }},
-      {"link to /dev/zero", EINVAL,
-       [](const std::string& p) { fs::create_symlink("/dev/zero", p); }},
-      {"dangling link", ENOENT, [&](const std::string& p) { fs::create_symlink(gone, p); }},
+    std::string path;
+    std::vector<std::string> args;
+    int status;
+    std::string out, log;  // |out| appears in the output; |log| is the log after
+  } rows[] = {
+      // clang-format off
+      {"manifest", kManifestPath, {K}, 1, kOn + kManifestPath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
+      {"digest file", kDigestFilePath, {K}, 1, kOn + kDigestFilePath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
+      {"digest file rebuilt", kDigestFilePath, {K, "hash"}, 0, folder ? kDigestFilePath + std::string(" open error!!!\n") : "", kOld},
+      {"EEPROM image", KEYMGR_EEPROM_PATH, {K}, 0, "Read Error [-" + e + "] - SFE CONF from EEPROM !!!\n", kOld},
+      {"EEPROM image written", KEYMGR_EEPROM_PATH, {H, "3"}, 1, "Write error - Message Digest to EEPROM !!!\n", kOld},
+      {"key identity", kKeyIdPath, {H, "1", "1"}, 1, "=\n\nVKT_DTC_AES_Init Failed.\nDecrypt Store Key Error!!\n" + kDtFail, kOld + "DT=FAIL\n"},
+      {"key identity written", kKeyIdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddkeyid"), kOld},
+      {"key password", kKeyPwdPath, {H, "1", "1"}, 1, "Failed to decrypt OOK.\n", kOld + "DT=FAIL\n"},
+      {"key password written", kKeyPwdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddpwd"), kOld},
+      {"sealed one-off key", kStoredOokPath, {H, "1", "1"}, 1, "Failed to open keymgr.ook\nDecrypt Store Key Error!!\n" + kDtFail, kOld + "DT=FAIL\n"},
+      {"sealed one-off key written", kStoredOokPath, {H, "3"}, folder ? 1 : 0, written("keymgr.ook"), kOld},
+      {"SC digest copy", kScDigestPath, {H, "1", "1"}, 1, kScDigestPath + std::string(" open error!!!\nGet Message Digest Error from HDD!!\n") + kDtFail, kOld + "DT=FAIL\n"},
+      {"SC digest copy written", kScDigestPath, {H, "3"}, 0, (folder ? kScDigestPath + std::string(" open error!!!\n") : "") + "SC Digest is created!!\n", kOld},
+      {"disk-mapper tool", kDmsetupPath, {H, "dmsetup"}, 1, std::string("file[") + kDmsetupPath + (kind.error == ENOENT ? "] status error : " : "] open error : ") + e + "\n", kOld},
+      // clang-format on
   };
-  for (const auto& kind : kinds) {
-    const bool folder = kind.error == EISDIR;
-    const std::string e = std::to_string(kind.error);
-    // A key file that cannot be replaced fails the regeneration at its step.
-    const auto written = [&](const char* name) {
-      return folder ? std::string("Failed to open ") + name + "\nGenerate Store Key Error!!!\n"
-                    : std::string("Successed to open ") + name + "\n";
-    };
-    const struct {
-      const char* name;
-      std::string path;
-      std::vector<std::string> args;
-      int status;
-      std::string out, log;  // |out| appears in the output; |log| is the log after
-    } rows[] = {
-        // clang-format off
-        {"manifest", kManifestPath, {K}, 1, kOn + kManifestPath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
-        {"digest file", kDigestFilePath, {K}, 1, kOn + kDigestFilePath + " open error!!!\nBN=FAIL\n", "BN=FAIL\n"},
-        {"digest file rebuilt", kDigestFilePath, {K, "hash"}, 0, folder ? kDigestFilePath + std::string(" open error!!!\n") : "", "OLD\n"},
-        {"EEPROM image", KEYMGR_EEPROM_PATH, {K}, 0, "Read Error [-" + e + "] - SFE CONF from EEPROM !!!\n", "OLD\n"},
-        {"EEPROM image written", KEYMGR_EEPROM_PATH, {H, "3"}, 1, "Write error - Message Digest to EEPROM !!!\n", "OLD\n"},
-        {"key identity", kKeyIdPath, {H, "1", "1"}, 1, "=\n\nVKT_DTC_AES_Init Failed.\nDecrypt Store Key Error!!\n" + kDtFail, "OLD\nDT=FAIL\n"},
-        {"key identity written", kKeyIdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddkeyid"), "OLD\n"},
-        {"key password", kKeyPwdPath, {H, "1", "1"}, 1, "Failed to decrypt OOK.\n", "OLD\nDT=FAIL\n"},
-        {"key password written", kKeyPwdPath, {H, "3"}, folder ? 1 : 0, written("keymgr.hddpwd"), "OLD\n"},
-        {"sealed one-off key", kStoredOokPath, {H, "1", "1"}, 1, "Failed to open keymgr.ook\nDecrypt Store Key Error!!\n" + kDtFail, "OLD\nDT=FAIL\n"},
-        {"sealed one-off key written", kStoredOokPath, {H, "3"}, folder ? 1 : 0, written("keymgr.ook"), "OLD\n"},
-        {"SC digest copy", kScDigestPath, {H, "1", "1"}, 1, kScDigestPath + std::string(" open error!!!\nGet Message Digest Error from HDD!!\n") + kDtFail, "OLD\nDT=FAIL\n"},
-        {"SC digest copy written", kScDigestPath, {H, "3"}, 0, (folder ? kScDigestPath + std::string(" open error!!!\n") : "") + "SC Digest is created!!\n", "OLD\n"},
-        {"disk-mapper tool", kDmsetupPath, {H, "dmsetup"}, 1, std::string("file[") + kDmsetupPath + (kind.error == ENOENT ? "] status error : " : "] open error : ") + e + "\n", "OLD\n"},
-        // clang-format on
-    };
-    for (const auto& row : rows) {
-      SCOPED_TRACE(std::string(kind.name) + " at the " + row.name);
+  for (const auto& row : rows) {
+    SCOPED_TRACE(std::string("at the ") + row.name);
+    restore();
+    fs::remove(row.path);
+    kind.plant(row.path);
+    std::vector<std::string> args = {"timeout", "10"};
+    args.insert(args.end(), row.args.begin(), row.args.end());
+    const RunResult run = test::Run(args);
+    EXPECT_EQ(run.status, row.status) << run.out;
+    EXPECT_NE(run.out.find(row.out), std::string::npos) << run.out;
+    EXPECT_EQ(ReadFile(kBootLogPath), row.log);
+    // Replaced, or left as it was; nothing is written through a link.
+    const bool writes = row.args.back() == "hash" || row.args.back() == "3";
+    EXPECT_EQ(fs::is_regular_file(fs::symlink_status(row.path)),
+              writes && !folder && row.path != KEYMGR_EEPROM_PATH);
+    EXPECT_FALSE(fs::exists(kGone));
+    // A regeneration that went through is the healthy state from now on.
+    if (row.args.back() == "3" && (run.status != 0 || folder)) {
       restore();
-      fs::remove(row.path);
-      kind.plant(row.path);
-      std::vector<std::string> args = {"timeout", "10"};
-      args.insert(args.end(), row.args.begin(), row.args.end());
-      const RunResult run = test::Run(args);
-      EXPECT_EQ(run.status, row.status) << run.out;
-      EXPECT_NE(run.out.find(row.out), std::string::npos) << run.out;
-      EXPECT_EQ(ReadFile(kBootLogPath), row.log);
-      // Replaced, or left as it was; nothing is written through a link.
-      const bool writes = row.args.back() == "hash" || row.args.back() == "3";
-      EXPECT_EQ(fs::is_regular_file(fs::symlink_status(row.path)),
-                writes && !folder && row.path != KEYMGR_EEPROM_PATH);
-      EXPECT_FALSE(fs::exists(gone));
-      // A regeneration that went through is the healthy state from now on.
-      if (row.args.back() == "3" && (run.status != 0 || folder)) {
-        restore();
-        ASSERT_EQ(test::Run({H, "3"}).status, 0);
-      }
-      if (row.args.back() == "3") {
-        snapshot();
-      }
+      ASSERT_EQ(test::Run({H, "3"}).status, 0);
+    }
+    if (row.args.back() == "3") {
+      snapshot();
     }
   }
+}
+const Kind kKinds[] = {
+    {"FIFO", EINVAL, [](const std::string& p) { mkfifo(p.c_str(), 0600); }},
+    {"folder", EISDIR, [](const std::string& p) { fs::create_directory(p); }},
+    {"link to dev zero", EINVAL, [](const std::string& p) { fs::create_symlink("/dev/zero", p); }},
+    {"dangling link", ENOENT, [](const std::string& p) { fs::create_symlink(kGone, p); }},
+};
+INSTANTIATE_TEST_SUITE_P(Rows, HostileFiles, testing::ValuesIn(kKinds), RowName());
+
+// A reader may hold the EEPROM image's lock as long as it likes: a
+// regeneration waits for it a few seconds, then fails at its first write.
+TEST_F(KmmHostE2e, RegenerationGivesUpOnAReadersLock) {
+  const int holder = open(KEYMGR_EEPROM_PATH, O_RDONLY | O_CLOEXEC);
+  ASSERT_EQ(flock(holder, LOCK_SH), 0);
+  const auto start = std::chrono::steady_clock::now();
+  const RunResult run = test::Run({"timeout", "10", H, "3"});
+  close(holder);
+  EXPECT_EQ(run.status, 1) << run.out;
+  EXPECT_NE(run.out.find("Write error - Message Digest to EEPROM !!!\n"), std::string::npos)
+      << run.out;
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(8));
 }
 
 // The boot status log's folder may be writable by other accounts. A link,
