@@ -64,11 +64,19 @@ int main(int argc, char** argv) {
     enabled = 1;
   }
 #ifdef KEYMGR_MEASURE_PCR
-  // One event a boot run: the verdict, or that nothing was verified.
-  keymgr::verdict::Verdict verdict = keymgr::verdict::Verdict::kNone;
-  const int result = enabled == 1 ? VerifyManifestVerdict(command.verbose, &verdict) : 0;
-  keymgr::cli::MeasureVerdict(KEYMGR_MEASURE_PCR, verdict);
-  return Finish(result);
+  keymgr::cli::BootTpm tpm;
+  keymgr::integrity::BootCheck check;
+#if KEYMGR_SIGNED_BUILD
+  // The EEPROM is writable by whoever the signature keeps out: a signed build
+  // verifies whatever its bits say.
+  enabled = 1;
+  check.floor = keymgr::cli::ReadReleaseFloor(tpm, KEYMGR_MEASURE_PCR);
+#endif
+  // One verdict a boot run, or that nothing was verified; a run whose
+  // verdict did not reach the TPM fails, so that no key proof follows it.
+  const int result = enabled == 1 ? VerifyManifestChecked(command.verbose, &check) : 0;
+  const bool measured = keymgr::cli::MeasureVerdict(tpm, KEYMGR_MEASURE_PCR, check);
+  return Finish(measured ? result : 1);
 #else
   if (enabled != 1) {
     return Finish(0);

@@ -1,78 +1,126 @@
 #include "cli/measure.h"
 
-#include <fcntl.h>
-
 #include <array>
-#include <cstdint>
-#include <cstdio>
-#include <optional>
+#include <span>
 
-#include "crypto/file_digest.h"
-#include "integrity/signature.h"
-#include "tpm/pcp.h"
+#include "keymgr_build_config.h"
+#include "policy/file.h"
+#include "tpm/chain.h"
+#include "util/debug_print.h"
+#include "util/hex.h"
 #include "util/io.h"
 #include "util/owned.h"
 #include "util/paths.h"
 #include "util/status.h"
-#include "verdict/event_log.h"
+#include "verdict/event_file.h"
 
 namespace keymgr::cli {
 
 namespace {
 
-// FileDigest is the SHA-256 of the file at |path|, when it can be hashed.
-std::optional<verdict::PcrValue> FileDigest(const char* path) {
-  verdict::PcrValue digest{};
-  if (!ComputeFileDigest(path, digest).ok()) {
-    return std::nullopt;
+// The vendor key of a sealed program, whose signed policies move the
+// counter there; other programs move it with the good verdict alone.
+#ifdef KEYMGR_PROGRAM_VENDOR_MODULUS
+constexpr std::optional<std::array<std::uint8_t, 256>> kVendorKey =
+    HexBytes<256>(KEYMGR_PROGRAM_VENDOR_MODULUS);
+static_assert(kVendorKey.has_value(), "KEYMGR_PROGRAM_VENDOR_MODULUS must be 512 hex digits");
+std::span<const std::uint8_t> VendorKey() {
+  return *kVendorKey;
+}
+#else
+std::span<const std::uint8_t> VendorKey() {
+  return {};
+}
+#endif
+
+// Connected opens the connection once; false once it failed.
+bool Connected(BootTpm& tpm) {
+  if (!tpm.opened && !tpm.failed) {
+    tpm.opened = true;
+    tpm.failed = !tpm::Connect(tpm.connection, tpm::BuildOptions()).ok();
   }
-  return digest;
+  return !tpm.failed && !tpm.connection.broken;
 }
 
-// Release is the counter of keymgr.sig, when a signed build reads one.
-std::optional<std::uint64_t> Release() {
 #if KEYMGR_SIGNED_BUILD
-  std::array<std::uint8_t, integrity::kSignatureFileSize> bytes{};
-  integrity::SignatureFile signature;
-  const File file = OpenFile(kSignaturePath, "r");
-  if (file && std::fread(bytes.data(), 1, bytes.size(), file.get()) == bytes.size() &&
-      integrity::DecodeSignatureFile(bytes, &signature).ok()) {
-    return signature.counter;
+// ReadPolicy reads the release's signed policy, whose counter approval a
+// sealed program's move needs.
+std::optional<policy::PolicyFile> ReadPolicy() {
+  const File stream = OpenFile(kPolicyPath, "r");
+  HeapBytes bytes;
+  std::size_t size = 0;
+  policy::PolicyFile file;
+  if (!stream || !ReadWhole(stream.get(), policy::kPolicyFileSize, bytes, &size) ||
+      !policy::DecodePolicyFile({bytes.get(), size}, &file).ok()) {
+    LogErrno(kPolicyPath);
+    return std::nullopt;
   }
-#endif
-  return std::nullopt;
+  return file;
 }
+
+// RaiseFloor moves the release counter up to the release just checked.
+void RaiseFloor(BootTpm& tpm, unsigned pcr, std::uint64_t release) {
+  const std::optional<policy::PolicyFile> file =
+      VendorKey().empty() ? std::optional<policy::PolicyFile>(policy::PolicyFile{}) : ReadPolicy();
+  if (!file ||
+      !tpm::RaiseReleaseFloor(tpm.connection, VendorKey(), static_cast<int>(pcr), release,
+                              VendorKey().empty() ? nullptr : &*file)
+           .ok()) {
+    LogRefused("move of the release counter");
+  }
+}
+#endif
 
 }  // namespace
 
-void MeasureVerdict(unsigned pcr, verdict::Verdict verdict) {
-  verdict::Event event;
-  event.pcr = pcr;
-  event.digest = verdict::VerdictDigest(verdict);
-  event.verdict = verdict;
-  const bool extended = pcp_extend_pcr(pcr, event.digest.data()) == 0;
-  if (!extended) {
+std::optional<std::uint64_t> ReadReleaseFloor(BootTpm& tpm, unsigned pcr) {
+  std::uint64_t floor = 0;
+  if (!Connected(tpm) ||
+      !tpm::ReadReleaseFloor(tpm.connection, VendorKey(), static_cast<int>(pcr), &floor).ok()) {
+    DebugPrint("release counter: no TPM to hold it against!!!\n");
+    return std::nullopt;
+  }
+  return floor;
+}
+
+bool MeasureVerdict(BootTpm& tpm, unsigned pcr, const integrity::BootCheck& check) {
+  std::array<verdict::Event, 2> events = {verdict::VerdictEvent(0, pcr, check.verdict)};
+  verdict::Event& measured = events[0];
+  if (check.verdict != verdict::Verdict::kNone) {
+    measured.manifestSha256 = check.manifestSha256;
+    measured.digestsSha256 = check.digestsSha256;
+    measured.release = check.release;
+  }
+  if (!Connected(tpm) || !tpm::ExtendPcr(tpm.connection, pcr, measured.digest).ok()) {
     LogRefused("extend of the boot verdict");
+    // A failed extend leaves the log empty: it never claims an event the
+    // PCR does not hold.
+    (void)verdict::WriteEventLog({});
+    return false;
   }
-  // The record of the event. What it names beside the verdict is for a
-  // verifier; only the verdict is measured.
-  if (verdict != verdict::Verdict::kNone) {
-    event.manifestSha256 = FileDigest(kManifestPath);
-    event.digestsSha256 = FileDigest(kDigestFilePath);
-    event.release = Release();
+  std::size_t count = 1;
+  bool closed = true;
+#if KEYMGR_SIGNED_BUILD
+  if (check.verdict == verdict::Verdict::kOk && check.release &&
+      (!check.floor || *check.floor < *check.release)) {
+    RaiseFloor(tpm, pcr, *check.release);
   }
-  std::array<char, verdict::kEventLineSize + 1> line{};
-  const std::size_t length =
-      verdict::EncodeEvent(event, std::span(line).first(verdict::kEventLineSize));
-  line[length] = '\n';
-  // The log lies beside the status log and is kept with the same care. A
-  // failed extend leaves it empty, so that it never claims an event the PCR
-  // does not hold.
-  const Descriptor log =
-      OpenRegular(kEventLogPath, O_WRONLY | O_CREAT | O_TRUNC, nullptr, Look::kOwnName);
-  if (!log || (extended && length > 0 && !WriteAll(log.get(), line.data(), length + 1))) {
-    LogErrno(!log ? "open" : "write");
+#if !KEYMGR_SEALED_PROGRAM
+  // No key proof follows to close the PCR, and a PCR left at the good value
+  // would let any later process move the counter.
+  events[1] = verdict::SeparatorEvent(1, pcr);
+  closed = tpm::ExtendPcr(tpm.connection, pcr, events[1].digest).ok();
+  if (closed) {
+    count = 2;
+  } else {
+    LogRefused("extend of the separator");
   }
+#endif
+#endif
+  if (Status status = verdict::WriteEventLog(std::span(events).first(count)); !status.ok()) {
+    LogRefused("event log");
+  }
+  return closed;
 }
 
 }  // namespace keymgr::cli

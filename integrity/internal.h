@@ -21,19 +21,22 @@ using Digest = std::array<std::uint8_t, crypto::kSha256Size>;
 #if KEYMGR_SIGNED_BUILD
 // SignedFiles holds the bytes that keymgr.sig covers, read once. Check reads
 // the digest file and the manifest whole, checks keymgr.sig against them and
-// the built-in key, and puts streams over the bytes it checked in the files'
-// place, so that a file swapped after the check changes nothing. It prints
-// the signature error line and returns false when the check fails, and the
-// release counter with |verbose|.
+// the built-in key, and its release against |check|'s floor, and puts
+// streams over the bytes it checked in the files' place, so that a file
+// swapped after the check changes nothing. It prints the signature error
+// line and returns false when the check fails, and the release counter with
+// |verbose|. Once it accepts, |check| takes the release and the digests of
+// the bytes checked.
 class SignedFiles {
  public:
-  bool Check(File& digests, File& manifest, bool verbose);
+  bool Check(File& digests, File& manifest, bool verbose, BootCheck* check);
 
  private:
   HeapBytes digests_, manifest_;
 };
-inline bool CheckSigned(SignedFiles& held, File& digests, File& manifest, bool verbose) {
-  return held.Check(digests, manifest, verbose);
+inline bool CheckSigned(SignedFiles& held, File& digests, File& manifest, bool verbose,
+                        BootCheck* check) {
+  return held.Check(digests, manifest, verbose, check);
 }
 // kHashRefused is HashManifest's result in a signed build: digest files are
 // made and signed on the build host.
@@ -42,7 +45,7 @@ inline constexpr int kHashRefused = 2;
 // Without a built-in key the files are taken as they are.
 struct SignedFiles {};
 inline bool CheckSigned(SignedFiles& /*held*/, File& /*digests*/, File& /*manifest*/,
-                        bool /*verbose*/) {
+                        bool /*verbose*/, BootCheck* /*check*/) {
   return true;
 }
 #endif

@@ -188,7 +188,8 @@ void VerifyManifestFile(const char* path) {
   SignedFiles held;
   File digests;
   File manifest;
-  if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, false)) {
+  BootCheck unheld;  // one file's check holds no release floor
+  if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, false, &unheld)) {
     return;
   }
   EntryRead read = EntryRead::kEnd;
@@ -218,20 +219,20 @@ void VerifyManifestFile(const char* path) {
 }
 
 int VerifyManifest(int verbose) {
-  keymgr::verdict::Verdict verdict = keymgr::verdict::Verdict::kNone;
-  return VerifyManifestVerdict(verbose, &verdict);
+  keymgr::integrity::BootCheck check;
+  return VerifyManifestChecked(verbose, &check);
 }
 
-int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict) {
+int VerifyManifestChecked(int verbose, keymgr::integrity::BootCheck* check) {
   using keymgr::verdict::Verdict;
   Outcome outcome = kAllPassed;
   SignedFiles held;  // outlives the streams that may read its bytes
   File digests;
   File manifest;
-  if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, verbose == 1)) {
+  if (!OpenBoth(digests, manifest) || !CheckSigned(held, digests, manifest, verbose == 1, check)) {
     CloseBoth(digests, manifest);
     WriteBootStatus(kBootStatusBnFail);
-    *verdict = Verdict::kFail;
+    check->verdict = Verdict::kFail;
     return 1;
   }
   {
@@ -264,6 +265,6 @@ int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict) {
   // The outcome travels only in the status line; the result says whether the
   // files could be opened and read.
   WriteBootStatus(outcome != kAllPassed ? kBootStatusBnFail : kBootStatusBnOk);
-  *verdict = outcome != kAllPassed ? Verdict::kFail : Verdict::kOk;
+  check->verdict = outcome != kAllPassed ? Verdict::kFail : Verdict::kOk;
   return outcome == kUnreadable ? 1 : 0;
 }

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <array>
+#include <cstdint>
 #include <cstdio>
+#include <optional>
 
 #include "util/paths.h"
 #include "verdict/verdict.h"
@@ -43,6 +45,25 @@ void VerifyManifestFile(const char* path);
 // per-file lines. Returns 1 when either file could not be opened, else 0.
 int VerifyManifest(int verbose);
 
-// VerifyManifestVerdict is VerifyManifest that also hands back the verdict
-// it wrote, kOk or kFail, in |*verdict|.
-int VerifyManifestVerdict(int verbose, keymgr::verdict::Verdict* verdict);
+namespace keymgr::integrity {
+
+// BootCheck is what a measured boot run tells the check, and what the check
+// tells it back.
+struct BootCheck {
+  // The release floor that keymgr.sig is held against in a signed build,
+  // when the TPM gave one: a lower release fails like a bad signature.
+  std::optional<std::uint64_t> floor;
+  // The verdict written, kOk or kFail.
+  verdict::Verdict verdict = verdict::Verdict::kNone;
+  // In a signed build, once keymgr.sig was accepted: its release, and the
+  // SHA-256 of the manifest and the digest file as the check read them.
+  std::optional<std::uint64_t> release;
+  std::optional<verdict::PcrValue> manifestSha256;
+  std::optional<verdict::PcrValue> digestsSha256;
+};
+
+}  // namespace keymgr::integrity
+
+// VerifyManifestChecked is VerifyManifest for a measured boot run, which
+// tells it |check|'s floor and takes the rest of |check| back.
+int VerifyManifestChecked(int verbose, keymgr::integrity::BootCheck* check);

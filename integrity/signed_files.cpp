@@ -3,6 +3,7 @@
 #include <optional>
 
 #include "integrity/internal.h"
+#include "crypto/hash.h"
 #include "integrity/signature.h"
 #include "keymgr_digest_key.h"
 #include "util/debug_print.h"
@@ -28,7 +29,7 @@ File Over(std::uint8_t* bytes, std::size_t size) {
 
 }  // namespace
 
-bool SignedFiles::Check(File& digests, File& manifest, bool verbose) {
+bool SignedFiles::Check(File& digests, File& manifest, bool verbose, BootCheck* check) {
   // The files first, then the signature file: what is checked is what was
   // read, whatever the files hold by the time the signature is.
   std::size_t digestsSize = 0;
@@ -45,6 +46,14 @@ bool SignedFiles::Check(File& digests, File& manifest, bool verbose) {
   } else {
     ok = false;
   }
+  // An older release than one that booted good is refused as a bad signature
+  // would be: its fixed faults stay fixed.
+  if (ok && check->floor && counter < *check->floor) {
+    DebugPrint("release counter: %llu is below the release that booted, %llu!!!\n",
+               static_cast<unsigned long long>(counter),
+               static_cast<unsigned long long>(*check->floor));
+    ok = false;
+  }
   if (!ok) {
     DebugPrint("%s signature error!!!\n", kSignaturePath);
     return false;
@@ -52,6 +61,9 @@ bool SignedFiles::Check(File& digests, File& manifest, bool verbose) {
   if (verbose) {
     DebugPrint("release counter: %llu\n", static_cast<unsigned long long>(counter));
   }
+  check->release = counter;
+  check->manifestSha256 = crypto::Sha256Of({manifest_.get(), manifestSize});
+  check->digestsSha256 = crypto::Sha256Of({digests_.get(), digestsSize});
   digests = Over(digests_.get(), digestsSize);
   manifest = Over(manifest_.get(), manifestSize);
   return digests && manifest;

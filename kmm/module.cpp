@@ -8,6 +8,8 @@
 #include "tpm/pcp.h"
 #include "util/debug_print.h"
 #include "util/secure.h"
+#include "util/status.h"
+#include "verdict/event_file.h"
 
 using namespace keymgr::kmm;
 
@@ -38,6 +40,26 @@ static_assert(offsetof(KeyContext, statusWord) < offsetof(KeyContext, oneOffKeyR
 namespace {
 // The module's one context. Its address is what a successful entry returns.
 KeyContext g_keyContext;
+
+// CloseBoot ends what a boot may open when keys are sealed to it: the
+// verdict PCR takes the separator after the first proof, whatever its
+// outcome, so that nothing later in the boot (another proof, another
+// process, a TPM resumed from its saved state) finds the good value there.
+// A host keeps the context it got. The event log records the separator.
+void CloseBoot() {
+  const int pcr = pcp_seal_pcr();
+  if (pcr < 0) {
+    return;
+  }
+  const auto event = keymgr::verdict::SeparatorEvent(0, static_cast<std::uint32_t>(pcr));
+  if (pcp_extend_pcr(static_cast<std::uint32_t>(pcr), event.digest.data()) != 0) {
+    keymgr::LogRefused("extend of the separator");
+    return;
+  }
+  if (!keymgr::verdict::AppendEvent(event).ok()) {
+    keymgr::LogRefused("event log");
+  }
+}
 }  // namespace
 
 extern "C" KeyContext* KeyManage(int32_t option, int logFlag) {
@@ -53,7 +75,9 @@ extern "C" KeyContext* KeyManage(int32_t option, int logFlag) {
   pcp_hold_connection();
   keymgr::ScopeExit release([] { pcp_release_connection(); });
   if (option == KMM_OPTION_NORMAL_BOOT) {
-    if (NormalBoot(&g_keyContext, logFlag) != 0) {
+    const int proved = NormalBoot(&g_keyContext, logFlag);
+    CloseBoot();
+    if (proved != 0) {
       DebugPrint("Normal Boot Error!!\n");
       return nullptr;
     }

@@ -11,6 +11,7 @@
 #include "keymgr_build_config.h"
 #include "policy/digests.h"
 #include "policy/file.h"
+#include "tpm/chain.h"
 #include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
@@ -167,6 +168,11 @@ Status CreateKey(Connection& tpm, const uint8_t* nameDigest, const uint8_t* pass
   // The auth value is the first command parameter of TPM2_CreateLoaded: the
   // salted session carries it encrypted.
   if (Status status = UseSaltedSession(tpm, TPMA_SESSION_DECRYPT); !status.ok()) {
+    return status;
+  }
+  // A sealed key's proofs salt their sessions to the storage key it is made
+  // under, which its creation pins.
+  if (Status status = tpm.options.sealPcr >= 0 ? PinParent(tpm) : Status(); !status.ok()) {
     return status;
   }
   TPM2B_SENSITIVE_CREATE sensitive{};

@@ -2,6 +2,7 @@
 // share while a caller holds it.
 #include <optional>
 
+#include "tpm/chain.h"
 #include "tpm/keys.h"
 #include "tpm/pcp.h"
 #include "util/random.h"
@@ -133,6 +134,19 @@ int pcp_decryptDataFragment(const char* nameHex, const char* passHex, const uint
   return OnTpm([&](Connection& tpm) {
     return Unseal(tpm, nameHex, passHex, fragment, length, out, outSize);
   });
+}
+
+int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest) {
+  if (digest == nullptr) {
+    return 1;
+  }
+  return OnTpm([&](Connection& tpm) {
+    return ExtendPcr(tpm, pcr, std::span<const uint8_t, 32>(digest, 32));
+  });
+}
+
+int pcp_seal_pcr(void) {
+  return BuildOptions().sealPcr;
 }
 
 int pcp_persist_srk(void) {

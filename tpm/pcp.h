@@ -82,8 +82,13 @@ PCP_NODISCARD int pcp_decryptDataFragment(const char* nameHex, const char* passH
                                           uint32_t* outSize);
 
 // pcp_extend_pcr extends PCR |pcr| (0 to 23) of the SHA-256 bank with the 32
-// bytes at |digest|, on a connection of its own.
+// bytes at |digest|, in a session salted to the pinned storage key, so that
+// an extend changed on its way is refused.
 PCP_NODISCARD int pcp_extend_pcr(uint32_t pcr, const uint8_t* digest);
+
+// pcp_seal_pcr is the PCR that holds the boot verdict when keys are sealed to
+// the boot (a build with KEYMGR_SEAL_TO_VERDICT), or -1 for plain keys.
+int pcp_seal_pcr(void);
 
 // pcp_persist_srk makes the standard storage root key persistent at
 // 0x81000001, or finds it there; keys are then created under it without
