@@ -82,6 +82,11 @@ void TpmProxy::Arm(Fault fault, int nth, std::uint32_t code) {
   traffic_.clear();
 }
 
+void TpmProxy::Rewrite(const std::string& from, const std::string& to) {
+  const std::lock_guard<std::mutex> guard(lock_);
+  std::tie(from_, to_) = std::tuple(from, to);
+}
+
 std::vector<TpmProxy::Command> TpmProxy::Sent() {
   const std::lock_guard<std::mutex> guard(lock_);
   return sent_;
@@ -111,6 +116,10 @@ void TpmProxy::Relay(int client) {
       traffic_ += message;
       const bool hit = nth_ != 0 ? static_cast<int>(sent_.size()) == nth_ : command.code == code_;
       fault = hit ? fault_ : Fault::kNone;
+      if (const std::size_t at = from_.empty() ? std::string::npos : message.find(from_);
+          at != std::string::npos) {
+        message.replace(at, from_.size(), to_);
+      }
     }
     if (log_ != nullptr) {
       std::fprintf(log_, "%03X %08X\n", command.code, command.handle);

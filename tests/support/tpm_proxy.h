@@ -1,7 +1,7 @@
 // A TPM that misbehaves on cue: a relay between the key manager and a TPM
 // simulator's socket that keeps what crossed it (the bus as a probe on it
 // would see it) and can leave one command unanswered, answer it with an
-// error code, or hang up on it.
+// error code, hang up on it, or change its bytes on the way.
 #pragma once
 
 #include <atomic>
@@ -38,6 +38,9 @@ class TpmProxy {
   // Arm forgets what was sent and gives |fault| to the |nth| command from
   // now (from 1), or with |nth| 0 to every command whose code is |code|.
   void Arm(Fault fault, int nth, std::uint32_t code = 0);
+  // Rewrite replaces |from| by |to| (as long) in every command from now on
+  // that holds it, as an interposer on the bus would; an empty |from| stops.
+  void Rewrite(const std::string& from, const std::string& to);
   // The commands, and every byte that crossed either way, since Arm.
   std::vector<Command> Sent();
   std::string Traffic();
@@ -55,6 +58,7 @@ class TpmProxy {
   std::uint32_t code_ = 0;
   std::vector<Command> sent_;
   std::string traffic_;
+  std::string from_, to_;
   int held_ = -1;  // the client of a withheld answer, closed at the next
   std::thread thread_;
 };
