@@ -39,6 +39,23 @@ install(FILES dist/man/keymgr-mkdigest.1 dist/man/keymgr-eventlog.1
 set(KEYMGR_UNITDIR "lib/systemd/system" CACHE STRING "Where the systemd unit is installed")
 set(KEYMGR_INITDIR "etc/init.d" CACHE STRING "Where the init script is installed")
 set(KEYMGR_BOOT_LOG "${KEYMGR_ROOT}/quorvan/spool/log/keymgr.log")
+# A measured build removes the event log with the status log, and first waits
+# a while for a TPM whose driver probes late: a run that cannot measure fails,
+# and no proof runs after it. Other builds keep the lines as they were.
+set(KEYMGR_BOOT_PREPARE "")
+set(KEYMGR_BOOT_PREPARE_UNIT "")
+if(NOT KEYMGR_MEASURE_PCR STREQUAL "")
+  set(_events "${KEYMGR_ROOT}/quorvan/spool/log/keymgr.events")
+  set(KEYMGR_BOOT_PREPARE "rm -f \"${_events}\"\n    ")
+  set(KEYMGR_BOOT_PREPARE_UNIT "ExecStartPre=-/bin/rm -f ${_events}\n")
+  if(KEYMGR_TCTI MATCHES "^device:(.+)$")
+    set(_wait "for _ in $(seq 20); do [ -e ${CMAKE_MATCH_1} ] && break; sleep 0.5; done")
+    set(KEYMGR_BOOT_PREPARE "${_wait}\n    ${KEYMGR_BOOT_PREPARE}")
+    # systemd takes "$$" for a "$" of the shell's.
+    string(REPLACE "$" "$$" _wait_unit "${_wait}")
+    set(KEYMGR_BOOT_PREPARE_UNIT "ExecStartPre=-/bin/sh -c '${_wait_unit}'\n${KEYMGR_BOOT_PREPARE_UNIT}")
+  endif()
+endif()
 configure_file(dist/keymgr-boot.service.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service @ONLY)
 configure_file(dist/keymgr-boot.init.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service DESTINATION ${KEYMGR_UNITDIR})
