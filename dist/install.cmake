@@ -56,6 +56,16 @@ if(NOT KEYMGR_MEASURE_PCR STREQUAL "")
     set(KEYMGR_BOOT_PREPARE_UNIT "ExecStartPre=-/bin/sh -c '${_wait_unit}'\n${KEYMGR_BOOT_PREPARE_UNIT}")
   endif()
 endif()
+# A measured build also ships the measured integration: the boot proof from
+# an initramfs-tools initramfs, over the root before the system switches to
+# it (docs/chain-of-trust.md).
+if(NOT KEYMGR_MEASURE_PCR STREQUAL "")
+  install(FILES dist/initramfs/keymgr-root.sh DESTINATION ${CMAKE_INSTALL_DATADIR}/keymgr)
+  install(PROGRAMS dist/initramfs/hooks/keymgr
+          DESTINATION ${CMAKE_INSTALL_DATADIR}/initramfs-tools/hooks)
+  install(PROGRAMS dist/initramfs/scripts/local-bottom/keymgr
+          DESTINATION ${CMAKE_INSTALL_DATADIR}/initramfs-tools/scripts/local-bottom)
+endif()
 configure_file(dist/keymgr-boot.service.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service @ONLY)
 configure_file(dist/keymgr-boot.init.in ${PROJECT_BINARY_DIR}/dist/keymgr-boot @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/dist/keymgr-boot.service DESTINATION ${KEYMGR_UNITDIR})

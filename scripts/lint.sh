@@ -30,5 +30,7 @@ echo "== cppcheck"
 cppcheck --project="$build/compile_commands.json" --enable=warning,portability,performance \
   --std=c++20 --inline-suppr --error-exitcode=1 --quiet -j "$(nproc)"
 echo "== shellcheck"
-shellcheck scripts/*.sh scripts/vm/*.sh scripts/vm/rows/*.sh bench/*.sh tests/dist/*.sh .ci/run
+shellcheck scripts/*.sh scripts/vm/*.sh scripts/vm/rows/*.sh bench/*.sh tests/dist/*.sh .ci/run \
+  dist/buildroot/*.sh dist/initramfs/keymgr-root.sh dist/initramfs/hooks/keymgr \
+  dist/initramfs/scripts/local-bottom/keymgr
 echo "lint: clean"
