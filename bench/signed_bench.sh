@@ -39,7 +39,7 @@ printf '%-16s %12s %12s %8s\n' "file set" "unsigned" "signed" "signed+"
 for count in 50 5000; do
   find "$data" -name 'f*' | sort | awk -v n="$count" 'NR <= n' >"$root/quorvan/hidden/keymgr.list"
   "$out/unsigned/tools/keymgr-mkdigest" --root / --manifest "$root/quorvan/hidden/keymgr.list" \
-    --output "$root/quorvan/hidden/keymgr.cb" --key "$out/digest-key.pem"
+    --output "$root/quorvan/hidden/keymgr.cb" --key "$out/digest-key.pem" --counter 1
   declare -A times=()
   for _ in $(seq "$runs"); do
     for variant in unsigned signed; do

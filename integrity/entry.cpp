@@ -34,4 +34,20 @@ EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry) {
                                                                             : EntryRead::kNul;
 }
 
+bool IsCanonicalEntry(std::string_view entry) {
+  if (!entry.starts_with('/')) {
+    return false;
+  }
+  // Each slash starts a component, up to the next slash or the end.
+  for (std::size_t at = 0; at != std::string_view::npos;) {
+    const std::size_t next = entry.find('/', at + 1);
+    const std::string_view name = entry.substr(at + 1, next - at - 1);
+    if (name.empty() || name == "." || name == "..") {
+      return false;
+    }
+    at = next;
+  }
+  return true;
+}
+
 }  // namespace keymgr::integrity

@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <optional>
+#include <string_view>
 
 #include "util/paths.h"
 #include "verdict/verdict.h"
@@ -28,6 +29,12 @@ enum class EntryRead {
 // byte and a read error each fail a run; none is taken for the end of the
 // manifest. Nothing is printed: entries may be read ahead of their turn.
 EntryRead ReadEntry(std::FILE* manifest, EntryBuffer& entry);
+
+// IsCanonicalEntry tells whether |entry| names its file the one way the
+// device reads it wherever it runs: an absolute path whose every component is
+// a name, none empty (a doubled or trailing slash), "." or "..". The device
+// hashes whatever entry it reads; the build host's tool signs only these.
+bool IsCanonicalEntry(std::string_view entry);
 
 }  // namespace keymgr::integrity
 

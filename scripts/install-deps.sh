@@ -24,7 +24,7 @@ declare -A jobs=(
   [build]="${build[*]}"
   [demo]="${build[*]} ${tpm[*]}"
   [test]="${build[*]} ${tpm[*]} swtpm-tools openssl libgtest-dev strace groff-base systemd
-          shellcheck ${packaging[*]}"
+          shellcheck fakeroot ${packaging[*]}"
   [lint]="${build[*]} openssl clang-tidy cppcheck shellcheck clang-format"
   [fuzz]="${build[*]} clang libclang-rt-14-dev"
   [package]="${build[*]} ${packaging[*]}"

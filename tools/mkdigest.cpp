@@ -1,12 +1,14 @@
 // keymgr-mkdigest: the digest file of an image's root, made on the build host
 // byte for byte as keymgr hash would make it on the device, and signed.
 //   keymgr-mkdigest --root DIR [--manifest FILE] [--output FILE]
-//                   [--key KEY.pem] [--counter N]
-// Each manifest entry is read with the device's own reader and resolved
-// inside DIR as the device resolves it at its root: an absolute symbolic link
-// points into DIR, and ".." never leaves it. An entry that cannot be hashed
-// is named, nothing is written and the exit status is 1. No root, no clock:
-// the same tree gives the same bytes on every host.
+//                   [--key KEY.pem --counter N]
+// The manifest is read with the device's own reader, and signed only when
+// the device will check it as it is hashed here: at least one entry, each an
+// absolute path in normal form. Each entry, and FILE below DIR, is resolved
+// inside DIR as the device resolves a path at its root: an absolute symbolic
+// link points into DIR, and ".." never leaves it. What cannot be signed or
+// hashed is named, nothing is written and the exit status is 1. No root, no
+// clock: the same tree gives the same bytes on every host.
 #include <openssl/pem.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -27,6 +29,7 @@
 #include "crypto/openssl_handles.h"
 #include "integrity/manifest.h"
 #include "integrity/signature.h"
+#include "tools/mkdigest_manifest.h"
 #include "util/atomic_file.h"
 #include "util/io.h"
 #include "util/owned.h"
@@ -34,17 +37,17 @@
 
 namespace {
 
-using keymgr::integrity::EntryRead;
-
 struct Args {
-  std::string root, manifest, output, key;
+  std::string root;              // without a trailing slash: "" is the host's root
+  std::string manifest, output;  // as given, below the root; "" for the defaults
+  std::string key;
   std::uint64_t counter = 0;
 };
 
 int Usage() {
   (void)std::fprintf(stderr,
                      "usage: keymgr-mkdigest --root DIR [--manifest FILE] [--output FILE] "
-                     "[--key KEY.pem] [--counter N]\n");
+                     "[--key KEY.pem --counter N]\n");
   return 2;
 }
 
@@ -53,10 +56,16 @@ int Fail(const std::string& what) {
   return 1;
 }
 
-// The device's fixed paths carry no KEYMGR_ROOT in a device build; a test
-// build's carry its sandbox, which the tool's defaults leave out.
-std::string InImage(const std::string& root, const char* fixed) {
-  return root + (fixed + std::strlen(KEYMGR_ROOT));
+// InImage is the path below the root of |given|, a path on this host that
+// starts with the root, or of the device's |fixed| path when none is given;
+// "" when |given| is not below the root. The device's fixed paths carry no
+// KEYMGR_ROOT in a device build; a test build's carry its sandbox, which the
+// defaults leave out.
+std::string InImage(const std::string& root, const std::string& given, const char* fixed) {
+  if (given.empty()) {
+    return fixed + std::strlen(KEYMGR_ROOT);
+  }
+  return given.starts_with(root + "/") ? given.substr(root.size()) : "";
 }
 
 bool ParseArgs(int argc, char** argv, Args& args) {
@@ -83,8 +92,9 @@ bool ParseArgs(int argc, char** argv, Args& args) {
   if (argc % 2 == 0 || args.root.empty()) {
     return false;
   }
-  args.manifest = args.manifest.empty() ? InImage(args.root, keymgr::kManifestPath) : args.manifest;
-  args.output = args.output.empty() ? InImage(args.root, keymgr::kDigestFilePath) : args.output;
+  while (args.root.ends_with('/')) {
+    args.root.pop_back();
+  }
   return true;
 }
 
@@ -94,7 +104,7 @@ std::string Under(const std::string& root, const std::vector<std::string>& at) {
   for (const std::string& component : at) {
     path.append("/").append(component);
   }
-  return path;
+  return path.empty() ? "/" : path;
 }
 
 // Follow replaces the link at |path|, the last of |at|, by its target in
@@ -117,9 +127,8 @@ bool Follow(const std::string& path, std::vector<std::string>& at, std::string& 
 
 // InRoot resolves |entry| inside |root| as the device resolves it at its own
 // root: component by component, a symbolic link replaced by its target (an
-// absolute one from the root again), ".." stopping at the root. A relative
-// entry is taken from the root, where a boot script starts. Returns the path
-// of the file on this host, or "" with errno set.
+// absolute one from the root again), ".." stopping at the root. Returns the
+// path of the file on this host, made of no link, or "" with errno set.
 std::string InRoot(const std::string& root, const std::string& entry) {
   std::vector<std::string> at;  // the components resolved so far, below the root
   std::string rest = entry;
@@ -180,6 +189,26 @@ int Write(const std::string& path, const void* bytes, std::size_t size) {
              : Fail(path + ": " + std::strerror(errno));
 }
 
+// HashEntries appends the digest of each of |entries|, resolved inside
+// |root|, to |digests|, as the digest file holds them; it names the first
+// that cannot be hashed and returns 1.
+int HashEntries(const std::string& root, const std::vector<std::string>& entries,
+                std::vector<std::uint8_t>& digests) {
+  for (const std::string& entry : entries) {
+    const std::string path = InRoot(root, entry);
+    std::array<std::uint8_t, keymgr::crypto::kSha256Size> digest{};
+    const keymgr::HashResult hashed = path.empty()
+                                          ? keymgr::HashResult{keymgr::HashResult::kStat, {}}
+                                          : keymgr::ComputeFileDigest(path.c_str(), digest);
+    if (!hashed.ok()) {
+      return Fail(entry + ": cannot be hashed (" +
+                  (hashed.failure == keymgr::HashResult::kStat ? "status" : "open") + " error)");
+    }
+    digests.insert(digests.end(), digest.begin(), digest.end());
+  }
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -187,45 +216,55 @@ int main(int argc, char** argv) {
   if (!ParseArgs(argc, argv, args)) {
     return Usage();
   }
+  // The device's release floor starts at 1 and never holds 0.
+  if (!args.key.empty() && args.counter == 0) {
+    (void)Fail("signing needs --counter N, from 1: no device holds release 0");
+    return 2;
+  }
+  const std::string manifestPath = InImage(args.root, args.manifest, keymgr::kManifestPath);
+  const std::string outputPath = InImage(args.root, args.output, keymgr::kDigestFilePath);
+  const std::size_t slash = outputPath.rfind('/');
+  const std::string name = outputPath.substr(slash + 1);
+  if (manifestPath.empty() || outputPath.empty()) {
+    return Fail((manifestPath.empty() ? args.manifest : args.output) + ": not below the root " +
+                args.root + "/");
+  }
+  if (name.empty() || name == "." || name == "..") {
+    return Fail(args.output + ": names no file");
+  }
   // The manifest is read once: the entries hashed are those of the bytes
   // whose digest is signed.
-  const keymgr::File file(std::fopen(args.manifest.c_str(), "rb"));
+  const std::string manifestFile = InRoot(args.root, manifestPath);
+  const keymgr::File file =
+      manifestFile.empty() ? keymgr::File() : keymgr::OpenFile(manifestFile.c_str(), "rb");
   keymgr::HeapBytes bytes;
   std::size_t size = 0;
   if (!file || !keymgr::ReadWhole(file.get(), SIZE_MAX, bytes, &size)) {
-    return Fail(args.manifest + ": " + std::strerror(errno));
+    return Fail(args.root + manifestPath + ": " + std::strerror(errno));
   }
   const std::span<const std::uint8_t> manifest(bytes.get(), size);
-  const keymgr::File entries(::fmemopen(bytes.get(), size, "r"));
+  std::vector<std::string> entries;
+  if (const std::string why = keymgr::tools::ReadSignableManifest(manifest, entries);
+      !why.empty()) {
+    return Fail(args.root + manifestPath + ": " + why);
+  }
   std::vector<std::uint8_t> digests;
-  keymgr::integrity::EntryBuffer entry{};
-  EntryRead read = EntryRead::kReadError;
-  while (entries &&
-         (read = keymgr::integrity::ReadEntry(entries.get(), entry)) == EntryRead::kEntry) {
-    const std::string path = InRoot(args.root, entry.data());
-    std::array<std::uint8_t, keymgr::crypto::kSha256Size> digest{};
-    const keymgr::HashResult hashed = path.empty()
-                                          ? keymgr::HashResult{keymgr::HashResult::kStat, {}}
-                                          : keymgr::ComputeFileDigest(path.c_str(), digest);
-    if (!hashed.ok()) {
-      return Fail(std::string(entry.data()) + ": cannot be hashed (" +
-                  (hashed.failure == keymgr::HashResult::kStat ? "status" : "open") + " error)");
-    }
-    digests.insert(digests.end(), digest.begin(), digest.end());
-    entry.fill(0);
+  if (HashEntries(args.root, entries, digests) != 0) {
+    return 1;
   }
-  if (read != EntryRead::kEnd) {
-    return Fail(args.manifest + ": an entry is too long, holds a NUL byte, or cannot be read");
-  }
-  // Everything is made before anything is written.
+  // Everything is made before anything is written. Both files are put in the
+  // output's folder, resolved inside the root; whatever sits at their names
+  // is replaced, never followed.
   std::array<std::uint8_t, keymgr::integrity::kSignatureFileSize> signature{};
   if (!args.key.empty() && Sign(args, manifest, digests, signature) != 0) {
     return 1;
   }
-  const std::size_t slash = args.output.rfind('/');
-  const std::string folder = slash == std::string::npos ? "" : args.output.substr(0, slash + 1);
-  if (Write(args.output, digests.data(), digests.size()) != 0) {
+  const std::string folder = InRoot(args.root, outputPath.substr(0, slash));
+  if (folder.empty()) {
+    return Fail(args.root + outputPath + ": " + std::strerror(errno));
+  }
+  if (Write(folder + "/" + name, digests.data(), digests.size()) != 0) {
     return 1;
   }
-  return args.key.empty() ? 0 : Write(folder + "keymgr.sig", signature.data(), signature.size());
+  return args.key.empty() ? 0 : Write(folder + "/keymgr.sig", signature.data(), signature.size());
 }
