@@ -4,7 +4,7 @@
 include(GNUInstallDirs)
 include(CMakePackageConfigHelpers)
 
-install(TARGETS keymgr kmm-host keymgr-eeprom keymgr-mkdigest keymgr-eventlog
+install(TARGETS keymgr kmm-host keymgr-eeprom keymgr-mkdigest keymgr-eventlog keymgr-mkpolicy
         RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
 install(TARGETS kmm kmm_shared EXPORT kmmTargets
         ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
@@ -31,7 +31,7 @@ install(FILES ${PROJECT_BINARY_DIR}/dist/kmm.pc DESTINATION ${CMAKE_INSTALL_LIBD
 install(FILES dist/man/keymgr.8 dist/man/kmm-host.8 dist/man/keymgr-eeprom.8
         DESTINATION ${CMAKE_INSTALL_MANDIR}/man8)
 install(FILES dist/man/libkmm.3 DESTINATION ${CMAKE_INSTALL_MANDIR}/man3)
-install(FILES dist/man/keymgr-mkdigest.1 dist/man/keymgr-eventlog.1
+install(FILES dist/man/keymgr-mkdigest.1 dist/man/keymgr-eventlog.1 dist/man/keymgr-mkpolicy.1
         DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
 
 # Boot integration. The unit and the script name the programs where this

@@ -148,4 +148,13 @@ Name CounterName(const Digest& counterPolicy, bool written) {
                      counterPolicy, kCounterSize);
 }
 
+Digest ApprovedKeyPolicy(PcrMask pcrs, const Digest& pcrDigest, std::uint64_t release,
+                         const Name& counter) {
+  return PolicyNv(PolicyPcr(Digest{}, pcrs, pcrDigest), release, TPM2_EO_UNSIGNED_LE, counter);
+}
+
+Digest ApprovedCounterPolicy(PcrMask pcrs, const Digest& pcrDigest) {
+  return PolicyCommandCode(PolicyPcr(Digest{}, pcrs, pcrDigest), TPM2_CC_NV_Increment);
+}
+
 }  // namespace keymgr::policy

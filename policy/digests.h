@@ -77,4 +77,14 @@ Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr, const
 // CounterName is the counter's name, |written| or not yet.
 Name CounterName(const Digest& counterPolicy, bool written);
 
+// The two policies the vendor approves for a release, over the PCRs of
+// |pcrs| at the values whose PcrDigest is |pcrDigest|:
+// ApprovedKeyPolicy, the sealed key's: those PCRs, then the release counter
+// named |counter| at most |release| (TPM_EO_UNSIGNED_LE);
+Digest ApprovedKeyPolicy(PcrMask pcrs, const Digest& pcrDigest, std::uint64_t release,
+                         const Name& counter);
+// ApprovedCounterPolicy, the counter's write: those PCRs, then
+// TPM2_NV_Increment.
+Digest ApprovedCounterPolicy(PcrMask pcrs, const Digest& pcrDigest);
+
 }  // namespace keymgr::policy
