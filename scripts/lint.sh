@@ -14,12 +14,13 @@ echo "== configuring $build/ =="
 # every opt-in build is analysed too.
 cmake -S . -B "$build" -G Ninja -DBUILD_TESTING=OFF -DCMAKE_EXPORT_COMPILE_COMMANDS=ON \
   -DKEYMGR_DIGEST_PUBKEY="$PWD/tests/cli/data/digest_key.pub.pem" -DKEYMGR_MEASURE_PCR=14 \
-  -DKEYMGR_SEAL_TO_VERDICT=ON >/dev/null
+  -DKEYMGR_SEAL_TO_VERDICT=ON -DKEYMGR_POLICY_PUBKEY="$PWD/tests/policy/data/vendor_key.pub.pem" \
+  >/dev/null
 
 echo "== clang-tidy"
 log=$build/clang-tidy.log
 if ! run-clang-tidy -p "$build" -quiet -j "$(nproc)" \
-    "^$PWD/(util|crypto|verdict|eeprom|tpm|bootlog|integrity|kmm|cli|tools)/" >"$log" 2>&1; then
+    "^$PWD/(util|crypto|verdict|policy|eeprom|tpm|bootlog|integrity|kmm|cli|tools)/" >"$log" 2>&1; then
   grep -v -E '^(clang-tidy|[0-9]+ warnings? generated|Suppressed [0-9]+ warnings|Use -header-filter)' \
     "$log" >&2
   echo "clang-tidy: findings above" >&2

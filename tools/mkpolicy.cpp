@@ -1,10 +1,11 @@
 // keymgr-mkpolicy: the boot-chain policy file of a release
 // (/quorvan/hidden/keymgr.policy), made and signed on the build host.
-//   keymgr-mkpolicy --key VENDOR.pem --release N --verdict-pcr P --uki FILE
+//   keymgr-mkpolicy --key VENDOR.pem --release N --verdict-pcr P [--uki FILE]
 //                   [--pcr I=HEX]... --output FILE
 // It binds PCR 4 and PCR 12 as the boot chain fills them when it starts the
 // unified kernel image FILE, the verdict PCR P at its value after one good
-// verdict, and any PCR I at HEX; the sealed key's policy also holds the
+// verdict, and any PCR I at HEX (at least one of --uki and --pcr: the boot
+// chain must be bound); the sealed key's policy also holds the
 // release counter to at most N. Both approved policies are signed with the
 // vendor's RSA-2048 key (PKCS#1 v1.5, which is deterministic): the same
 // inputs give the same file. Prints what it bound and signed.
@@ -53,7 +54,7 @@ int Usage(const std::string& why) {
   (void)std::fprintf(stderr,
                      "keymgr-mkpolicy: %s\n"
                      "usage: keymgr-mkpolicy --key VENDOR.pem --release N --verdict-pcr P "
-                     "--uki FILE [--pcr I=HEX]... --output FILE\n",
+                     "[--uki FILE] [--pcr I=HEX]... --output FILE\n",
                      why.c_str());
   return 2;
 }
@@ -126,16 +127,23 @@ bool ParseArgs(int argc, char** argv, Args& args, std::string& why) {
       return false;
     }
   }
-  if (args.key.empty() || args.uki.empty() || args.output.empty() || args.release == 0 ||
-      args.verdictPcr < 0) {
-    why = "--key, --release, --verdict-pcr, --uki and --output are all needed";
+  if (args.key.empty() || args.output.empty() || args.release == 0 || args.verdictPcr < 0) {
+    why = "--key, --release, --verdict-pcr and --output are all needed";
     return false;
   }
-  const policy::PcrMask predicted = policy::PcrMask{1} << policy::kBootImagePcr |
-                                    policy::PcrMask{1} << policy::kLoadOptionsPcr |
-                                    policy::PcrMask{1} << args.verdictPcr;
+  // A policy of the verdict alone would open for whoever runs first and
+  // extends the good value: it binds the boot chain too.
+  if (args.uki.empty() && args.given == 0) {
+    why = "the boot chain is needed: --uki, or --pcr for each of its PCRs";
+    return false;
+  }
+  const policy::PcrMask predicted =
+      (args.uki.empty() ? 0
+                        : policy::PcrMask{1} << policy::kBootImagePcr |
+                              policy::PcrMask{1} << policy::kLoadOptionsPcr) |
+      policy::PcrMask{1} << args.verdictPcr;
   if ((args.given & predicted) != 0) {
-    why = "--pcr names PCR 4, 12 or the verdict PCR, whose values are predicted";
+    why = "--pcr names the verdict PCR, or PCR 4 or 12 with --uki, whose values are predicted";
     return false;
   }
   return true;
@@ -198,26 +206,27 @@ int main(int argc, char** argv) {
   if (ReadVendorKey(args.key, key, modulus) != 0) {
     return 1;
   }
-  const keymgr::File file(std::fopen(args.uki.c_str(), "rb"));
-  keymgr::HeapBytes bytes;
-  std::size_t size = 0;
-  if (!file || !keymgr::ReadWhole(file.get(), kMaxUkiSize, bytes, &size)) {
-    return Fail(args.uki + ": " + std::strerror(errno));
-  }
-  policy::UkiPcrs predicted;
-  if (keymgr::Status status = policy::PredictUkiPcrs({bytes.get(), size}, &predicted);
-      !status.ok()) {
-    return Fail(args.uki + ": not a unified kernel image the boot chain starts (" + status.call() +
-                ")");
-  }
-
   policy::PolicyFile policyFile;
   policyFile.release = args.release;
-  policyFile.pcrs = args.given | policy::PcrMask{1} << policy::kBootImagePcr |
-                    policy::PcrMask{1} << policy::kLoadOptionsPcr |
-                    policy::PcrMask{1} << args.verdictPcr;
-  args.values.at(policy::kBootImagePcr) = predicted.bootImages;
-  args.values.at(policy::kLoadOptionsPcr) = predicted.loadOptions;
+  policyFile.pcrs = args.given | policy::PcrMask{1} << args.verdictPcr;
+  if (!args.uki.empty()) {
+    const keymgr::File file(std::fopen(args.uki.c_str(), "rb"));
+    keymgr::HeapBytes bytes;
+    std::size_t size = 0;
+    if (!file || !keymgr::ReadWhole(file.get(), kMaxUkiSize, bytes, &size)) {
+      return Fail(args.uki + ": " + std::strerror(errno));
+    }
+    policy::UkiPcrs predicted;
+    if (keymgr::Status status = policy::PredictUkiPcrs({bytes.get(), size}, &predicted);
+        !status.ok()) {
+      return Fail(args.uki + ": not a unified kernel image the boot chain starts (" +
+                  status.call() + ")");
+    }
+    policyFile.pcrs |= policy::PcrMask{1} << policy::kBootImagePcr |
+                       policy::PcrMask{1} << policy::kLoadOptionsPcr;
+    args.values.at(policy::kBootImagePcr) = predicted.bootImages;
+    args.values.at(policy::kLoadOptionsPcr) = predicted.loadOptions;
+  }
   args.values.at(args.verdictPcr) = keymgr::verdict::GoodPcrValue();
   std::vector<policy::Digest> bound;
   for (int pcr = 0; pcr < kPcrCount; ++pcr) {
