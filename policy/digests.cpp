@@ -134,18 +134,21 @@ Name NvIndexName(std::uint32_t handle, std::uint32_t attributes, const Digest& a
                     .Final());
 }
 
-Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr, const Digest& goodPcr) {
+Counter ReleaseCounter(std::span<const std::uint8_t> vendor, int verdictPcr,
+                       const Digest& goodPcr) {
   if (!vendor.empty()) {
-    return PolicyAuthorize(RsaSigningKeyName(vendor), kCounterPolicyRef);
+    return {kAuthorizedCounterHandle,
+            PolicyAuthorize(RsaSigningKeyName(vendor), kCounterPolicyRef)};
   }
   const Digest good[] = {goodPcr};
-  return PolicyCommandCode(PolicyPcr(Digest{}, PcrMask{1} << verdictPcr, PcrDigest(good)),
-                           TPM2_CC_NV_Increment);
+  return {kCounterHandle,
+          PolicyCommandCode(PolicyPcr(Digest{}, PcrMask{1} << verdictPcr, PcrDigest(good)),
+                            TPM2_CC_NV_Increment)};
 }
 
-Name CounterName(const Digest& counterPolicy, bool written) {
-  return NvIndexName(kCounterHandle, kCounterAttributes | (written ? kCounterWritten : 0),
-                     counterPolicy, kCounterSize);
+Name CounterName(const Counter& counter, bool written) {
+  return NvIndexName(counter.handle, kCounterAttributes | (written ? kCounterWritten : 0),
+                     counter.policy, kCounterSize);
 }
 
 Digest ApprovedKeyPolicy(PcrMask pcrs, const Digest& pcrDigest, std::uint64_t release,

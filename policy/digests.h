@@ -61,21 +61,30 @@ inline constexpr std::array<std::uint8_t, 14> kCounterPolicyRef = {
 
 // The release counter: an 8-byte TPM_NT_COUNTER NV index in the owner range
 // (TCG's registry of handles: 0x01800000-0x01BFFFFF) that only a policy
-// session can move and anyone can read with its empty password.
-inline constexpr std::uint32_t kCounterHandle = 0x01800B0Eu;
+// session can move and anyone can read with its empty password. A build
+// whose counter the vendor's approvals move and one whose counter the good
+// verdict alone moves each have a handle of their own, so that neither
+// finds the other's counter in its place.
+inline constexpr std::uint32_t kCounterHandle = 0x01800B0Eu;            // the verdict's
+inline constexpr std::uint32_t kAuthorizedCounterHandle = 0x01800B0Fu;  // the vendor's
 inline constexpr std::uint16_t kCounterSize = 8;
 // TPM_NT_COUNTER | POLICYWRITE | AUTHREAD | NO_DA; the TPM sets WRITTEN on
 // the first increment.
 inline constexpr std::uint32_t kCounterAttributes = 0x02040018u;
 inline constexpr std::uint32_t kCounterWritten = 0x20000000u;
 
-// CounterPolicy is the counter's authPolicy: the vendor's approval for the
-// counter when |vendor| (an RSA modulus) is given, else the good verdict
-// |goodPcr| in PCR |verdictPcr| for TPM2_NV_Increment.
-Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr, const Digest& goodPcr);
+struct Counter {
+  std::uint32_t handle;
+  Digest policy;  // its authPolicy
+};
 
-// CounterName is the counter's name, |written| or not yet.
-Name CounterName(const Digest& counterPolicy, bool written);
+// ReleaseCounter is a build's counter: moved by the vendor's approval for
+// the counter when |vendor| (an RSA modulus) is given, else by the good
+// verdict |goodPcr| in PCR |verdictPcr| for TPM2_NV_Increment.
+Counter ReleaseCounter(std::span<const std::uint8_t> vendor, int verdictPcr, const Digest& goodPcr);
+
+// CounterName is |counter|'s name, |written| or not yet.
+Name CounterName(const Counter& counter, bool written);
 
 // The two policies the vendor approves for a release, over the PCRs of
 // |pcrs| at the values whose PcrDigest is |pcrDigest|:

@@ -222,8 +222,8 @@ int main(int argc, char** argv) {
       return Fail(args.uki + ": not a unified kernel image the boot chain starts (" +
                   status.call() + ")");
     }
-    policyFile.pcrs |= policy::PcrMask{1} << policy::kBootImagePcr |
-                       policy::PcrMask{1} << policy::kLoadOptionsPcr;
+    policyFile.pcrs |= policy::PcrMask{1} << policy::kBootImagePcr | policy::PcrMask{1}
+                                                                         << policy::kLoadOptionsPcr;
     args.values.at(policy::kBootImagePcr) = predicted.bootImages;
     args.values.at(policy::kLoadOptionsPcr) = predicted.loadOptions;
   }
@@ -237,7 +237,7 @@ int main(int argc, char** argv) {
   const policy::Digest pcrDigest = policy::PcrDigest(bound);
   // The sealed key reads the counter once a release has moved it: written.
   const policy::Name counter = policy::CounterName(
-      policy::CounterPolicy(modulus, args.verdictPcr, keymgr::verdict::GoodPcrValue()), true);
+      policy::ReleaseCounter(modulus, args.verdictPcr, keymgr::verdict::GoodPcrValue()), true);
   policyFile.keyPolicy =
       policy::ApprovedKeyPolicy(policyFile.pcrs, pcrDigest, args.release, counter);
   policyFile.counterPolicy = policy::ApprovedCounterPolicy(policyFile.pcrs, pcrDigest);

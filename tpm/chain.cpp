@@ -84,23 +84,23 @@ Status Approve(Connection& tpm, ESYS_TR session, std::span<const std::uint8_t> v
                          SizedOf<TPM2B_NAME>(policy::RsaSigningKeyName(vendor)), *ticket.get());
 }
 
-// CounterPolicy is the counter's authPolicy in this build.
-policy::Digest CounterPolicy(std::span<const std::uint8_t> vendor, int verdictPcr) {
-  return policy::CounterPolicy(vendor, verdictPcr, verdict::GoodPcrValue());
+// CounterOf is the release counter of this build.
+policy::Counter CounterOf(std::span<const std::uint8_t> vendor, int verdictPcr) {
+  return policy::ReleaseCounter(vendor, verdictPcr, verdict::GoodPcrValue());
 }
 
-TPM2B_NV_PUBLIC CounterPublic(std::span<const std::uint8_t> vendor, int verdictPcr) {
+TPM2B_NV_PUBLIC CounterPublic(const policy::Counter& counter) {
   TPM2B_NV_PUBLIC area{};
-  area.nvPublic.nvIndex = policy::kCounterHandle;
+  area.nvPublic.nvIndex = counter.handle;
   area.nvPublic.nameAlg = TPM2_ALG_SHA256;
   area.nvPublic.attributes = policy::kCounterAttributes;
-  area.nvPublic.authPolicy = SizedOf<TPM2B_DIGEST>(CounterPolicy(vendor, verdictPcr));
+  area.nvPublic.authPolicy = SizedOf<TPM2B_DIGEST>(counter.policy);
   area.nvPublic.dataSize = policy::kCounterSize;
   return area;
 }
 
-// Counter is the release counter, open on a connection.
-struct Counter {
+// OpenedCounter is the release counter, open on a connection.
+struct OpenedCounter {
   PersistentObject index;
   bool written = false;
 };
@@ -108,36 +108,34 @@ struct Counter {
 // OpenCounter opens the release counter, defining it on first use, and
 // holds its name against the one this build gives it.
 Status OpenCounter(Connection& tpm, std::span<const std::uint8_t> vendor, int verdictPcr,
-                   Counter* counter) {
-  const TPM2B_NV_PUBLIC area = CounterPublic(vendor, verdictPcr);
+                   OpenedCounter* opened) {
+  const policy::Counter counter = CounterOf(vendor, verdictPcr);
   ESYS_TR index = ESYS_TR_NONE;
-  if (!OpenPersistent(tpm, policy::kCounterHandle, &index).ok()) {
+  if (!OpenPersistent(tpm, counter.handle, &index).ok()) {
     if (tpm.broken) {
       return Refused("TPM connection lost");
     }
-    if (Status status = NvDefineSpace(tpm, area, &index); !status.ok()) {
+    if (Status status = NvDefineSpace(tpm, CounterPublic(counter), &index); !status.ok()) {
       return status;
     }
   }
-  counter->index.reset(tpm.Object(index));
+  opened->index.reset(tpm.Object(index));
   Output<TPM2B_NAME> name;
   if (Status status = Check("Esys_TR_GetName", Esys_TR_GetName(tpm.ctx(), index, name.out()));
       !status.ok()) {
     return status;
   }
-  const policy::Digest authPolicy = CounterPolicy(vendor, verdictPcr);
   const auto is = [&](bool written) {
-    const policy::Name expected = policy::CounterName(authPolicy, written);
+    const policy::Name expected = policy::CounterName(counter, written);
     return name.get()->size == expected.size() &&
            std::equal(expected.begin(), expected.end(), name.get()->name);
   };
-  counter->written = is(true);
-  return counter->written || is(false)
-             ? Status()
-             : Refused("another NV index at the release counter's handle");
+  opened->written = is(true);
+  return opened->written || is(false) ? Status()
+                                      : Refused("another NV index at the release counter's handle");
 }
 
-Status ReadCounter(Connection& tpm, const Counter& counter, std::uint64_t* value) {
+Status ReadCounter(Connection& tpm, const OpenedCounter& counter, std::uint64_t* value) {
   *value = 0;
   if (!counter.written) {
     return Status();
@@ -209,7 +207,8 @@ Status MeetKeyPolicy(Connection& tpm, ESYS_TR session, const policy::PolicyFile&
     return status;
   }
   ESYS_TR counter = ESYS_TR_NONE;
-  if (Status status = OpenPersistent(tpm, policy::kCounterHandle, &counter); !status.ok()) {
+  if (Status status = OpenPersistent(tpm, policy::kAuthorizedCounterHandle, &counter);
+      !status.ok()) {
     return status;
   }
   PersistentObject counterIndex(tpm.Object(counter));
@@ -233,7 +232,7 @@ Status ReadReleaseFloor(Connection& tpm, std::span<const std::uint8_t> vendor, i
   if (Status status = UsePinnedParent(tpm); !status.ok()) {
     return status;
   }
-  Counter counter;
+  OpenedCounter counter;
   if (Status status = OpenCounter(tpm, vendor, verdictPcr, &counter); !status.ok()) {
     return status;
   }
@@ -245,7 +244,7 @@ Status RaiseReleaseFloor(Connection& tpm, std::span<const std::uint8_t> vendor, 
   if (Status status = UsePinnedParent(tpm); !status.ok()) {
     return status;
   }
-  Counter counter;
+  OpenedCounter counter;
   std::uint64_t floor = 0;
   if (Status status = OpenCounter(tpm, vendor, verdictPcr, &counter); !status.ok()) {
     return status;

@@ -123,7 +123,7 @@ TEST_F(Mkpolicy, TheTpmComputesThePolicyDigestsAndNamesAsTheLibraryDoes) {
   // A counter with the release counter's attributes, beside its handle, and
   // a policy that the test meets: its name before and after an increment,
   // and PolicyNV over it.
-  const std::string handle = "0x01800B0F";
+  const std::string handle = "0x01800C0E";  // beside the counters of the builds
   const Digest increment = PolicyCommandCode(Digest{}, TPM2_CC_NV_Increment);
   WriteFile(dir_ + "increment.policy", Text(increment));
   ASSERT_EQ(Tpm2({"tpm2_nvdefine", handle, "-C", "o", "-s", "8", "-a", "0x02040018", "-L",
@@ -136,14 +136,14 @@ TEST_F(Mkpolicy, TheTpmComputesThePolicyDigestsAndNamesAsTheLibraryDoes) {
     const std::string out = Tpm2({"tpm2_nvreadpublic", handle}).out;
     return std::regex_search(out, match, kName) ? FromHex(match[1].str()) : "";
   };
-  EXPECT_EQ(name(), Text(NvIndexName(kCounterHandle + 1, kCounterAttributes, increment, 8)));
+  EXPECT_EQ(name(), Text(NvIndexName(kCounterHandle + 0x100, kCounterAttributes, increment, 8)));
   const std::string session = dir_ + "write.ctx";
   EXPECT_EQ(Tpm2({"tpm2_startauthsession", "--policy-session", "-S", session}).status, 0);
   EXPECT_EQ(Tpm2({"tpm2_policycommandcode", "-S", session, "TPM2_CC_NV_Increment"}).status, 0);
   EXPECT_EQ(Tpm2({"tpm2_nvincrement", "-C", handle, "-P", "session:" + session, handle}).status, 0);
   Tpm2({"tpm2_flushcontext", session});
   const Name written =
-      NvIndexName(kCounterHandle + 1, kCounterAttributes | kCounterWritten, increment, 8);
+      NvIndexName(kCounterHandle + 0x100, kCounterAttributes | kCounterWritten, increment, 8);
   EXPECT_EQ(name(), Text(written));
   WriteFile(dir_ + "release.bin", FromHex("0000000000000007"));
   EXPECT_EQ(Trial(dir_, {policyPcr, {"tpm2_policynv", "-i", dir_ + "release.bin", handle, "ule"}}),
@@ -200,7 +200,7 @@ TEST_F(Mkpolicy, TheSameInputsGiveTheSameSignedFileThatTheTpmVerifies) {
                                       verdict::GoodPcrValue()};
   const Digest pcrDigest = PcrDigest(values);
   const Name counter =
-      CounterName(CounterPolicy(Array<256>(Modulus()), 15, verdict::GoodPcrValue()), true);
+      CounterName(ReleaseCounter(Array<256>(Modulus()), 15, verdict::GoodPcrValue()), true);
   EXPECT_EQ(file.keyPolicy, ApprovedKeyPolicy(file.pcrs, pcrDigest, 9, counter));
   EXPECT_EQ(file.counterPolicy, ApprovedCounterPolicy(file.pcrs, pcrDigest));
   EXPECT_EQ(printed["key policy"], Text(file.keyPolicy));
