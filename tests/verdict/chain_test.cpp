@@ -1,0 +1,429 @@
+// The chain of trust of a sealed build on the suite's swtpm, as an attacker
+// with the disk, the TPM bus and root after boot tries it: keymgr-sealed
+// (signed, measuring into PCR 14) and the module with its key sealed under
+// the test vendor key, each boot's boot chain standing in as PCR 4 extended
+// with the digest of the image the firmware started.
+#include <gtest/gtest.h>
+#include <kmm/kmm.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <memory>
+
+#include "keymgr_build_config.h"
+#include "policy/file.h"
+#include "support/sandbox.h"
+#include "support/tpm_bus.h"
+#include "support/tpm_settings.h"
+#include "tpm/chain.h"
+#include "util/hex.h"
+#include "util/paths.h"
+#include "verdict/verdict.h"
+
+namespace keymgr::test {
+namespace {
+
+namespace fs = std::filesystem;
+
+const std::string S = KEYMGR_TEST_SEALED_BIN, G = KEYMGR_TEST_SIGNED_BIN;
+const std::string kSource = KEYMGR_TEST_SOURCE_DIR;
+const std::string kA = InRoot("/d/a"), kEvents = kEventLogPath;
+constexpr auto kVendor = *HexBytes<256>(KEYMGR_TEST_VENDOR_MODULUS);
+constexpr std::uint32_t kStartAuthSession = 0x176, kRsaDecrypt = 0x159, kRhNull = 0x40000007;
+
+std::string Lower(std::string_view bytes) {
+  std::string hex(2 * bytes.size(), '0');
+  HexEncode({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()}, hex.data(),
+            HexCase::kLower);
+  return hex;
+}
+
+std::string Text(const verdict::PcrValue& value) {
+  return {reinterpret_cast<const char*>(value.data()), value.size()};
+}
+
+// Firmware extends PCR 4 with the digest of the boot image it starts.
+void Firmware(const std::string& image) {
+  ASSERT_EQ(Tpm2({"tpm2_pcrextend", "4:sha256=" + Lower(Sha256(image))}).status, 0);
+}
+
+// Release lays out release |n| for the boot image |image|: a listed file,
+// the signed digest file, and the vendor's policy for that image's PCR 4.
+// It gives back the files, to put an old release back with Restore.
+using Files = std::map<std::string, std::string>;
+Files Release(std::uint64_t n, const std::string& image) {
+  WriteFile(kA, "release " + std::to_string(n));
+  WriteFile(kManifestPath, kA);
+  EXPECT_EQ(Run({KEYMGR_TEST_MKDIGEST_BIN, "--root", "/", "--manifest", kManifestPath, "--output",
+                 kDigestFilePath, "--key", kSource + "/tests/cli/data/digest_key.pem", "--counter",
+                 std::to_string(n)})
+                .status,
+            0);
+  const std::string pcr4 = Lower(Sha256(std::string(32, '\0') + Sha256(image)));
+  EXPECT_EQ(Run({KEYMGR_TEST_MKPOLICY_BIN, "--key", kSource + "/tests/policy/data/vendor_key.pem",
+                 "--release", std::to_string(n), "--verdict-pcr", "14", "--pcr", "4=" + pcr4,
+                 "--output", kPolicyPath})
+                .status,
+            0);
+  Files files;
+  for (const std::string& path : {kA, std::string(kManifestPath), std::string(kDigestFilePath),
+                                  std::string(kSignaturePath), std::string(kPolicyPath)}) {
+    files[path] = *ReadFile(path);
+  }
+  return files;
+}
+
+void Restore(const Files& files) {
+  for (const auto& [path, bytes] : files) {
+    WriteFile(path, bytes);
+  }
+}
+
+// Floor is the release counter at |handle| (by default sealed builds'), 0
+// while it was never moved.
+std::uint64_t Floor(const std::string& handle = "0x01800B0F") {
+  const RunResult read = Tpm2({"tpm2_nvread", handle, "-s", "8"});
+  std::uint64_t floor = 0;
+  for (std::size_t i = 0; read.status == 0 && i < 8 && i < read.out.size(); ++i) {
+    floor = floor << 8 | static_cast<std::uint8_t>(read.out[i]);
+  }
+  return floor;
+}
+
+// Away makes the suite's swtpm unreachable while it lives.
+struct Away {
+  Away() { fs::rename(kSwtpm, kSwtpm + ".away"); }
+  ~Away() { fs::rename(kSwtpm + ".away", kSwtpm); }
+};
+
+// Interposer puts a proxy on the bus of every process, tpm2-tools included:
+// it takes the swtpm's socket path while it lives.
+struct Interposer {
+  Interposer() : moved(), proxy(kSwtpm, kSwtpm + ".away") {}
+  ~Interposer() { fs::remove(kSwtpm); }
+  Away moved;
+  TpmProxy proxy;
+};
+
+// KillTpm kills the suite's swtpm as a power cut would, and starts it again
+// on the state it left.
+void KillTpm() {
+  const fs::path run = fs::path(kSwtpm).parent_path();
+  const pid_t pid = std::stoi(*ReadFile(run / "swtpm.pid"));
+  ASSERT_EQ(::kill(pid, SIGKILL), 0);
+  while (::kill(pid, 0) == 0) {
+    ::usleep(10000);
+  }
+  fs::remove(kSwtpm);
+  fs::remove(kSwtpm + ".ctrl");
+  ASSERT_EQ(Run({"swtpm", "socket", "--tpm2", "--server", "type=unixio,path=" + kSwtpm, "--ctrl",
+                 "type=unixio,path=" + kSwtpm + ".ctrl", "--tpmstate",
+                 "dir=" + (run / "swtpm-state").string(), "--flags", "not-need-init,startup-clear",
+                 "--pid", "file=" + (run / "swtpm.pid").string(), "--daemon"})
+                .status,
+            0);
+  for (int i = 0; i < 100 && Tpm2({"tpm2_getcap", "properties-fixed"}).status != 0; ++i) {
+    ::usleep(50000);
+  }
+}
+
+// Proved runs the module's boot proof and gives its one-off key, or "" when
+// the proof failed.
+std::string Proved() {
+  const KeyContext* context = nullptr;
+  Output([&] { context = KeyManage(KMM_OPTION_NORMAL_BOOT, 1); });
+  return context != nullptr ? OneOffKey(context) : "";
+}
+
+// Each row starts from a device provisioned with release |base_| of image
+// "A": its key made under the vendor's policies, the storage key pinned.
+// Releases start above where earlier tests left the counter.
+class Chain : public testing::Test {
+ public:
+  void SetUp() override {
+    UseSealPcr(14, kVendor);
+    ResetDevice(0x42, 4);
+    base_ = Floor() + 10;
+    first_ = Release(base_, "A");
+    ASSERT_NE(KeyManage(KMM_OPTION_REGENERATE, 0), nullptr);
+  }
+  void TearDown() override { UseSealPcr(-1); }
+
+  // Boot power-cycles the TPM, lets the firmware measure |image| and runs
+  // keymgr's boot run.
+  static RunResult Boot(const std::string& image, const std::string& program = S) {
+    PowerCycleTpm();
+    Firmware(image);
+    return test::Run({program});
+  }
+
+  const TpmClean clean_;
+  std::uint64_t base_ = 0;
+  Files first_;
+};
+
+struct Row {
+  const char* name;
+  void (*attack)(Chain& chain);
+};
+class ChainRows : public Chain, public testing::WithParamInterface<Row> {};
+TEST_P(ChainRows, HoldsAgainstTheAttack) {
+  GetParam().attack(*this);
+}
+
+// Each row with the device it leaves: a good boot of the provisioned release
+// proves the key after any of them.
+void GenuineBootOnARecordedBus(Chain& /*chain*/) {
+  Interposer bus;
+  const RunResult run = Chain::Boot("A");
+  EXPECT_EQ(run.status, 0) << run.out;
+  bus.proxy.Arm(TpmProxy::Fault::kNone, 0);
+  const std::string ook = Proved();
+  ASSERT_FALSE(ook.empty());
+  // The decryption's session was salted: with the disk and the bus, the
+  // session key is still not to be had. The key never crosses in clear.
+  std::uint32_t salt = 0;
+  for (const auto& [code, handle] : bus.proxy.Sent()) {
+    if (code == kStartAuthSession) {
+      salt = handle;
+    } else if (code == kRsaDecrypt) {
+      break;
+    }
+  }
+  EXPECT_NE(salt, 0u);
+  EXPECT_NE(salt, kRhNull);
+  EXPECT_EQ(bus.proxy.Traffic().find(ook), std::string::npos);
+}
+
+void FailRewrittenToGoodOnTheBus(Chain& /*chain*/) {
+  WriteFile(kA, "altered");
+  Interposer bus;
+  bus.proxy.Rewrite(Text(verdict::VerdictDigest(verdict::Verdict::kFail)),
+                    Text(verdict::VerdictDigest(verdict::Verdict::kOk)));
+  const RunResult run = Chain::Boot("A");
+  EXPECT_EQ(run.status, 1) << "the changed extend was refused: " << run.out;
+  EXPECT_NE(run.out.find("BN=FAIL"), std::string::npos);
+  bus.proxy.Rewrite("", "");
+  EXPECT_EQ(Proved(), "");
+}
+
+void KeymgrSkippedAndTheGoodValueExtendedByHand(Chain& /*chain*/) {
+  PowerCycleTpm();
+  Firmware("A without keymgr");
+  Tpm2({"tpm2_pcrextend",
+        "14:sha256=" + Lower(Text(verdict::VerdictDigest(verdict::Verdict::kOk)))});
+  EXPECT_EQ(Proved(), "");
+}
+
+void AChangedKernel(Chain& /*chain*/) {
+  EXPECT_EQ(Chain::Boot("A with another kernel").status, 0);
+  EXPECT_EQ(Proved(), "");
+}
+
+void ASecondProofInTheSameBoot(Chain& /*chain*/) {
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  EXPECT_NE(Proved(), "");
+  EXPECT_EQ(Proved(), "") << "a host keeps the context it got";
+  // The log records the verdict, then the proof's separator.
+  const std::string events = *ReadFile(kEvents);
+  EXPECT_NE(events.find("\"recnum\":1,\"pcr\":14"), std::string::npos) << events;
+  EXPECT_NE(events.find("\"separator\""), std::string::npos) << events;
+}
+
+void ATpmResumedAfterAProof(Chain& /*chain*/) {
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  EXPECT_NE(Proved(), "");
+  // TPM2_Shutdown(STATE), then the TPM's init and TPM2_Startup(STATE): a
+  // resume keeps the PCRs as they were.
+  ASSERT_EQ(Tpm2({"tpm2_shutdown"}).status, 0);
+  ASSERT_EQ(Run({"swtpm_ioctl", "--unix", kSwtpm + ".ctrl", "-i"}).status, 0);
+  ASSERT_EQ(Tpm2({"tpm2_startup"}).status, 0);
+  EXPECT_EQ(Proved(), "");
+}
+
+void TheTpmUnreachableAtTheBootRun(Chain& /*chain*/) {
+  PowerCycleTpm();
+  Firmware("A");
+  {
+    const Away tpm;
+    const RunResult run = Run({S});
+    EXPECT_EQ(run.status, 1) << run.out;
+    EXPECT_EQ(ReadFile(kEvents), "") << "no event is claimed";
+  }
+  EXPECT_EQ(Proved(), "") << "the TPM came back, the verdict did not";
+}
+
+void ANewReleaseWithANewPolicyNeedsNoReseal(Chain& chain) {
+  Release(chain.base_ + 1, "B");
+  EXPECT_EQ(Chain::Boot("B").status, 0);
+  EXPECT_NE(Proved(), "");
+  EXPECT_EQ(Floor(), chain.base_ + 1);
+}
+
+// Release 5 good, 6 good, 5 again refused, 7 good.
+void AnOlderReleasePutBack(Chain& chain) {
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  EXPECT_EQ(Floor(), chain.base_);
+  Release(chain.base_ + 1, "A");
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  EXPECT_NE(Proved(), "");
+  Restore(chain.first_);
+  const RunResult old = Chain::Boot("A");
+  EXPECT_EQ(old.status, 1);
+  EXPECT_NE(old.out.find("release counter: " + std::to_string(chain.base_) +
+                         " is below the release that booted, " + std::to_string(chain.base_ + 1) +
+                         "!!!\n" + kSignaturePath + " signature error!!!\n"),
+            std::string::npos)
+      << old.out;
+  EXPECT_EQ(Proved(), "");
+  Release(chain.base_ + 2, "A");
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  EXPECT_NE(Proved(), "");
+  EXPECT_EQ(Floor(), chain.base_ + 2);
+}
+
+// A boot cut short at each command of the counter's move (the bus hung up,
+// the swtpm killed and started again on its state), then a good boot: the
+// move is completed.
+void APowerCutInTheCountersMove(Chain& chain) {
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  Release(chain.base_ + 1, "A");
+  std::vector<TpmProxy::Command> sent;
+  {
+    Interposer bus;
+    PowerCycleTpm();
+    Firmware("A");
+    bus.proxy.Arm(TpmProxy::Fault::kNone, 0);
+    ASSERT_EQ(Run({S}).status, 0);
+    sent = bus.proxy.Sent();
+  }
+  // The move follows the verdict's extend.
+  std::size_t first = 0;
+  while (first < sent.size() && sent[first].code != 0x182) {
+    ++first;
+  }
+  // Each cut is back at the previous release, its counter not yet moved.
+  for (std::size_t cut = first + 2; cut <= sent.size(); ++cut) {
+    SCOPED_TRACE("cut at command " + std::to_string(cut));
+    {
+      Interposer bus;
+      PowerCycleTpm();
+      Firmware("A");
+      bus.proxy.Arm(TpmProxy::Fault::kHangUp, static_cast<int>(cut));
+      Run({S});
+    }
+    KillTpm();
+    ASSERT_EQ(Chain::Boot("A").status, 0);
+    EXPECT_EQ(Floor(), chain.base_ + 1);
+    EXPECT_NE(Proved(), "");
+  }
+}
+
+void TheCounterMovedWithoutAGoodVerdict(Chain& chain) {
+  ASSERT_EQ(Chain::Boot("A").status, 0);
+  WriteFile(kA, "altered");
+  ASSERT_EQ(Chain::Boot("A").status, 0);  // BN=FAIL, measured
+  tpm::Connection tpm;
+  ASSERT_TRUE(tpm::Connect(tpm, tpm::BuildOptions()).ok());
+  policy::PolicyFile file;
+  const std::string bytes = *ReadFile(kPolicyPath);
+  ASSERT_TRUE(policy::DecodePolicyFile(
+                  {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()}, &file)
+                  .ok());
+  EXPECT_FALSE(tpm::RaiseReleaseFloor(tpm, kVendor, 14, chain.base_ + 5, &file).ok());
+  EXPECT_EQ(Floor(), chain.base_);
+}
+
+void NoTpmTheSignedBuildSaysSo(Chain& /*chain*/) {
+  const Away tpm;
+  const RunResult run = Run({S});
+  EXPECT_EQ(run.out, "SFE_003 - [4]\nrelease counter: no TPM to hold it against!!!\nBN=OK\n");
+  EXPECT_EQ(run.status, 1) << "nothing was measured";
+}
+
+void TheGateClosedWithAFileAltered(Chain& /*chain*/) {
+  MakeEeprom(0, 0);
+  WriteFile(kA, "altered");
+  const RunResult run = Chain::Boot("A");
+  EXPECT_EQ(run.out, "SFE_003 - [0]\nBN=FAIL\n");
+  EXPECT_EQ(Proved(), "");
+}
+
+// The event log names what the check read, read once, and is a file of the
+// running user's, whatever another account planted at its path.
+void TheEventLogSaysWhatWasChecked(Chain& chain) {
+  WriteFile(kEvents, "planted");
+  ASSERT_EQ(::chown(kEvents.c_str(), 65534, 65534), 0);
+  struct stat before {};
+  ASSERT_EQ(::stat(kEvents.c_str(), &before), 0);
+  PowerCycleTpm();
+  Firmware("A");
+  const std::string trace = "/tmp/keymgr-chain-" + std::to_string(::getpid());
+  ASSERT_EQ(Run(Traced({"-o", trace, "-e", "trace=openat"}, {S})).status, 0);
+  std::ifstream in(trace);
+  std::map<std::string, int> opened;
+  for (std::string line; std::getline(in, line);) {
+    for (const char* path : {kManifestPath, kDigestFilePath, kSignaturePath}) {
+      opened[path] += line.find(std::string("\"") + path + "\"") != std::string::npos;
+    }
+  }
+  fs::remove(trace);
+  for (const auto& [path, count] : opened) {
+    EXPECT_EQ(count, 1) << path;
+  }
+  struct stat after {};
+  ASSERT_EQ(::stat(kEvents.c_str(), &after), 0);
+  EXPECT_EQ(after.st_uid, 0u);
+  EXPECT_NE(after.st_ino, before.st_ino);
+  EXPECT_EQ(after.st_mode & 07777, 0644u);
+  const std::string events = *ReadFile(kEvents);
+  for (const std::string& file : {chain.first_[kManifestPath], chain.first_[kDigestFilePath]}) {
+    EXPECT_NE(events.find(Lower(Sha256(file))), std::string::npos) << events;
+  }
+  EXPECT_NE(events.find("\"release\":" + std::to_string(chain.base_) + "}"), std::string::npos);
+}
+
+// A signed build without sealed keys closes the PCR itself, after the move:
+// a process after the boot run cannot move the counter.
+void TheSignedBuildClosesThePcrItself(Chain& /*chain*/) {
+  // The suite's other signed boots run release 42 on this build's counter.
+  Release(42, "A");
+  PowerCycleTpm();
+  ASSERT_EQ(Run({G}).status, 0);
+  EXPECT_EQ(Floor("0x01800B0E"), 42u);
+  tpm::Connection tpm;
+  ASSERT_TRUE(tpm::Connect(tpm, tpm::BuildOptions()).ok());
+  std::uint64_t floor = 0;
+  ASSERT_TRUE(tpm::ReadReleaseFloor(tpm, {}, 14, &floor).ok());
+  EXPECT_FALSE(tpm::RaiseReleaseFloor(tpm, {}, 14, floor + 1, nullptr).ok());
+  const std::string events = *ReadFile(kEvents);
+  EXPECT_NE(events.find("\"separator\""), std::string::npos) << events;
+}
+
+const Row kRows[] = {
+    {"a genuine boot on a recorded bus", GenuineBootOnARecordedBus},
+    {"the FAIL extend rewritten to the good one on the bus", FailRewrittenToGoodOnTheBus},
+    {"keymgr skipped and the good value extended by hand",
+     KeymgrSkippedAndTheGoodValueExtendedByHand},
+    {"a changed kernel", AChangedKernel},
+    {"a second proof in the same boot", ASecondProofInTheSameBoot},
+    {"a TPM resumed after a proof", ATpmResumedAfterAProof},
+    {"the TPM unreachable at the boot run", TheTpmUnreachableAtTheBootRun},
+    {"a new release with a new policy needs no reseal", ANewReleaseWithANewPolicyNeedsNoReseal},
+    {"an older release put back", AnOlderReleasePutBack},
+    {"a power cut in the counter's move", APowerCutInTheCountersMove},
+    {"the counter moved without a good verdict", TheCounterMovedWithoutAGoodVerdict},
+    {"no TPM, the signed build says so", NoTpmTheSignedBuildSaysSo},
+    {"the gate closed with a file altered", TheGateClosedWithAFileAltered},
+    {"the event log says what was checked", TheEventLogSaysWhatWasChecked},
+    {"the signed build closes the PCR itself", TheSignedBuildClosesThePcrItself},
+};
+INSTANTIATE_TEST_SUITE_P(Rows, ChainRows, testing::ValuesIn(kRows), RowName());
+
+}  // namespace
+}  // namespace keymgr::test
