@@ -5,7 +5,11 @@
 # wall time of each on a fresh swtpm; again with a persistent SRK when the
 # build's kmm-host can make one. A build with KEYMGR_MEASURE_PCR (and
 # KEYMGR_SEAL_TO_VERDICT) is measured as a device boots it: each boot proof
-# follows a power cycle and keymgr's boot run.
+# follows a power cycle, the firmware's measurement of a boot image into
+# PCR 4, and keymgr's boot run, whose own commands are counted too. A signed
+# or sealed build must be configured with the test keys
+# (tests/cli/data/digest_key.pub.pem, tests/policy/data/vendor_key.pub.pem):
+# the bench signs its release with their private halves.
 #   bench/tpm_bench.sh BUILD_DIR [N]        (N defaults to 9)
 # BUILD_DIR must be configured with -DKEYMGR_TCTI=swtpm:path=ROOT/run/proxy.sock
 # (ROOT its KEYMGR_ROOT); the proxy comes from $TPM_PROXY, by default
@@ -36,19 +40,38 @@ trap 'kill $proxy_pid 2>/dev/null; scripts/swtpm-fixture.sh stop "$upstream" >/d
 for _ in $(seq 50); do [ -S "$listen" ] && break; sleep 0.1; done
 "$eeprom" init
 "$eeprom" write 4958 04000000   # SFE_003 on, so the boot proof logs its line
-# An empty manifest passes: a measured build's boot run then gives the good
-# verdict.
-: >"$root/quorvan/hidden/keymgr.list"
-"$build/cli/keymgr" hash
+# One listed file, its digest file made as the build takes it: signed on the
+# host for a signed build, with the vendor's policy for a sealed one.
+hidden=$root/quorvan/hidden
+echo bench >"$root/quorvan/listed"
+echo "$root/quorvan/listed" >"$hidden/keymgr.list"
+# PCR 4 once the firmware measured the boot image "image".
+image_pcr=$( (head -c 32 /dev/zero; printf image | openssl dgst -sha256 -binary) |
+  openssl dgst -sha256 -r | cut -d' ' -f1)
+if [ -n "$(build_setting "$build" KEYMGR_DIGEST_PUBKEY)" ]; then
+  "$build/tools/keymgr-mkdigest" --root / --manifest "$hidden/keymgr.list" \
+    --output "$hidden/keymgr.cb" --key tests/cli/data/digest_key.pem --counter 1
+else
+  "$build/cli/keymgr" hash
+fi
+if [ "$(build_setting "$build" KEYMGR_SEAL_TO_VERDICT)" = ON ]; then
+  "$build/tools/keymgr-mkpolicy" --key tests/policy/data/vendor_key.pem --release 1 \
+    --verdict-pcr "$(build_setting "$build" KEYMGR_MEASURE_PCR)" --pcr "4=$image_pcr" \
+    --output "$hidden/keymgr.policy" >/dev/null
+fi
 
 # before_boot readies a boot proof of a measured build, whose key may need
-# the verdict in its PCR: a power cycle (PCRs reset), then keymgr's boot run.
-# Neither is counted or timed.
+# the verdict in its PCR: a power cycle (PCRs reset), the firmware's
+# measurement, then keymgr's boot run. None is counted or timed.
 measured=$(build_setting "$build" KEYMGR_MEASURE_PCR)
-before_boot() {
-  [ -n "$measured" ] || return 0
+power_on() {
   swtpm_ioctl --unix "$root/tpm/swtpm.sock.ctrl" -i
   tpm2_startup -c -T "$upstream"
+  tpm2_pcrextend -T "$upstream" "4:sha256=$(printf image | sha256sum | cut -d' ' -f1)"
+}
+before_boot() {
+  [ -n "$measured" ] || return 0
+  power_on
   "$build/cli/keymgr" >/dev/null
 }
 
@@ -57,6 +80,15 @@ boot_ms() {
   for _ in $(seq "$runs"); do
     before_boot
     wall_ms "$host" 1 1
+  done | median
+}
+
+# keymgr_ms prints the median wall time of RUNS boot runs, each after a
+# power cycle and the firmware's measurement.
+keymgr_ms() {
+  for _ in $(seq "$runs"); do
+    power_on
+    wall_ms "$build/cli/keymgr"
   done | median
 }
 
@@ -74,6 +106,10 @@ cost() {
 report() {
   "$host" 3 >/dev/null   # a previous key for the measured regeneration to replace
   echo "$1 kmm-host 3:   $(cost "$host" 3); median $(median_ms "$runs" "$host" 3) ms over $runs runs"
+  if [ -n "$measured" ]; then
+    power_on
+    echo "$1 keymgr:       $(cost "$build/cli/keymgr"); median $(keymgr_ms) ms over $runs runs"
+  fi
   before_boot
   echo "$1 kmm-host 1 1: $(cost "$host" 1 1); median $(boot_ms) ms over $runs runs"
 }

@@ -22,6 +22,12 @@ namespace {
 
 namespace eeprom = keymgr::eeprom;
 
+#if KEYMGR_SIGNED_BUILD
+constexpr bool kSignedBuild = true;
+#else
+constexpr bool kSignedBuild = false;
+#endif
+
 // Finish flushes what was printed so the boot script's capture is complete
 // before the status is seen.
 int Finish(int status) {
@@ -58,20 +64,19 @@ int main(int argc, char** argv) {
       break;
   }
 
-  int enabled = ControlByteEnablesVerification() ? 1 : 0;
+  const bool controlled = ControlByteEnablesVerification();
   // Always asked, so every gated run shows the SFE_003 line.
-  if (CheckSecurityFeature() != 0) {
-    enabled = 1;
-  }
+  const bool featured = CheckSecurityFeature() != 0;
+  // The EEPROM is writable by whoever the signature keeps out: a signed build
+  // reads its bits and shows them as any build does, and verifies whatever
+  // they say.
+  const int enabled = kSignedBuild || controlled || featured ? 1 : 0;
 #ifdef KEYMGR_MEASURE_PCR
   keymgr::cli::BootTpm tpm;
   keymgr::integrity::BootCheck check;
-#if KEYMGR_SIGNED_BUILD
-  // The EEPROM is writable by whoever the signature keeps out: a signed build
-  // verifies whatever its bits say.
-  enabled = 1;
-  check.floor = keymgr::cli::ReadReleaseFloor(tpm, KEYMGR_MEASURE_PCR);
-#endif
+  if (kSignedBuild) {
+    check.floor = keymgr::cli::ReadReleaseFloor(tpm, KEYMGR_MEASURE_PCR);
+  }
   // One verdict a boot run, or that nothing was verified; a run whose
   // verdict did not reach the TPM fails, so that no key proof follows it.
   const int result = enabled == 1 ? VerifyManifestChecked(command.verbose, &check) : 0;
