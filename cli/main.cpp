@@ -28,6 +28,14 @@ constexpr bool kSignedBuild = true;
 constexpr bool kSignedBuild = false;
 #endif
 
+// Verifies tells whether a boot run verifies, from what the control byte and
+// the SFE_003 bit say. The EEPROM is writable by whoever the signature keeps
+// out: a signed build reads and shows its bits as any build does, and
+// verifies whatever they say.
+bool Verifies(bool controlled, bool featured) {
+  return kSignedBuild || controlled || featured;
+}
+
 // Finish flushes what was printed so the boot script's capture is complete
 // before the status is seen.
 int Finish(int status) {
@@ -67,10 +75,7 @@ int main(int argc, char** argv) {
   const bool controlled = ControlByteEnablesVerification();
   // Always asked, so every gated run shows the SFE_003 line.
   const bool featured = CheckSecurityFeature() != 0;
-  // The EEPROM is writable by whoever the signature keeps out: a signed build
-  // reads its bits and shows them as any build does, and verifies whatever
-  // they say.
-  const int enabled = kSignedBuild || controlled || featured ? 1 : 0;
+  const int enabled = Verifies(controlled, featured) ? 1 : 0;
 #ifdef KEYMGR_MEASURE_PCR
   keymgr::cli::BootTpm tpm;
   keymgr::integrity::BootCheck check;
