@@ -223,9 +223,9 @@ Status DeleteKey(Connection& tpm, const uint8_t* nameDigest) {
 namespace {
 
 // ForEachOwnKey calls |each| with the handle of every persistent key of this
-// key manager.
+// key manager but the one at |skip|, which it does not even read.
 template <class Each>
-Status ForEachOwnKey(Connection& tpm, Each each) {
+Status ForEachOwnKey(Connection& tpm, uint32_t skip, Each each) {
   TPMS_CAPABILITY_DATA data{};
   if (Status status =
           GetCapability(tpm, TPM2_CAP_HANDLES, kOwnKeysFirst, TPM2_MAX_CAP_HANDLES, &data);
@@ -238,7 +238,7 @@ Status ForEachOwnKey(Connection& tpm, Each each) {
   for (uint32_t i = 0; i < handles.count; ++i) {
     const uint32_t handle = handles.handle[i];
     TPM2B_PUBLIC area{};
-    if (handle <= kOwnerPersistentLast && ReadOwnKey(tpm, handle, &area).ok()) {
+    if (handle <= kOwnerPersistentLast && handle != skip && ReadOwnKey(tpm, handle, &area).ok()) {
       each(handle);
     }
   }
@@ -250,10 +250,7 @@ Status ForEachOwnKey(Connection& tpm, Each each) {
 Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
   const uint32_t keep = keepNameDigest != nullptr ? PersistentHandle(keepNameDigest) : 0;
   Status result;
-  Status listed = ForEachOwnKey(tpm, [&](uint32_t handle) {
-    if (handle == keep) {
-      return;
-    }
+  Status listed = ForEachOwnKey(tpm, keep, [&](uint32_t handle) {
     if (Status status = EvictControl(tpm, handle, handle); !status.ok()) {
       result = status;
     }
@@ -263,7 +260,7 @@ Status EvictStaleKeys(Connection& tpm, const uint8_t* keepNameDigest) {
 
 Status ListOwnKeys(Connection& tpm, std::span<uint32_t> handles, uint32_t* count) {
   *count = 0;
-  return ForEachOwnKey(tpm, [&](uint32_t handle) {
+  return ForEachOwnKey(tpm, 0, [&](uint32_t handle) {
     if (*count < handles.size()) {
       handles[*count] = handle;
     }
