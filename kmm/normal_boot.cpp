@@ -35,6 +35,18 @@ struct LocalTimeText {
   }
 };
 
+// The stored copies of the SC digest, in the order they are proved, with the
+// lines that name them.
+struct StoredCopy {
+  int (*read)(std::uint8_t* dst);
+  const char* readError;
+  const char* name;
+};
+constexpr StoredCopy kStoredCopies[] = {
+    {ReadDigestEEPROM, "Get Message Digest Error [EEPROM]!!\n", "EEPROM"},
+    {ReadDigestHDD, "Get Message Digest Error from HDD!!\n", "HDD"},
+};
+
 // An all-0xFF or all-zero start marks a region that never held a key.
 bool HoldsNoKey(const std::array<std::uint8_t, kSealedKeySize>& key) {
   return (key[0] == 0xFF && key[1] == 0xFF) || (key[0] == 0x00 && key[1] == 0x00);
@@ -95,26 +107,18 @@ int NormalBoot(KeyContext* context, int logFlag) {
     return fail();
   }
   // The EEPROM copy is proved first; the disk copy is read only after it.
-  std::array<std::uint8_t, kScDigestSize> stored{};
-  if (ReadDigestEEPROM(stored.data()) != 0) {
-    DebugPrint("Get Message Digest Error [EEPROM]!!\n");
-    return fail();
+  for (const StoredCopy& copy : kStoredCopies) {
+    std::array<std::uint8_t, kScDigestSize> stored{};
+    if (copy.read(stored.data()) != 0) {
+      DebugPrint("%s", copy.readError);
+      return fail();
+    }
+    if (std::memcmp(computed.data(), stored.data(), kScDigestSize) != 0) {
+      DebugPrint("SC Digest Test Fail [%s]!!\n", copy.name);
+      return fail();
+    }
+    DebugPrint("SC Digest Test Success [%s]!!\n", copy.name);
   }
-  if (std::memcmp(computed.data(), stored.data(), kScDigestSize) != 0) {
-    DebugPrint("SC Digest Test Fail [EEPROM]!!\n");
-    return fail();
-  }
-  DebugPrint("SC Digest Test Success [EEPROM]!!\n");
-  std::array<std::uint8_t, kScDigestSize> onDisk{};
-  if (ReadDigestHDD(onDisk.data()) != 0) {
-    DebugPrint("Get Message Digest Error from HDD!!\n");
-    return fail();
-  }
-  if (std::memcmp(computed.data(), onDisk.data(), kScDigestSize) != 0) {
-    DebugPrint("SC Digest Test Fail [HDD]!!\n");
-    return fail();
-  }
-  DebugPrint("SC Digest Test Success [HDD]!!\n");
   if (logFlag != 0) {
     WriteBootStatus(kBootStatusDtOk);
   }

@@ -13,36 +13,41 @@
 
 using namespace keymgr::kmm;
 
-int RegenerateKey(KeyContext* context) {
-  if (GenerateSeedKey(context) != 0) {
-    DebugPrint("Generate Seed Key Error!!!\n");
-    return 1;
+namespace {
+
+// Failed tells whether a step's |result| is a failure, and prints its line
+// then.
+bool Failed(int result, const char* line) {
+  if (result != 0) {
+    DebugPrint("%s", line);
   }
-  if (GenerateSecretKey(context) != 0) {
-    DebugPrint("Generate Secret Key Error!!!\n");
-    return 1;
-  }
-  // The digest is stored before the store key is sealed and written: a later
-  // failure leaves the new digest beside the old store key, and the next boot
-  // reports the mismatch until a regeneration succeeds.
-  std::array<std::uint8_t, kScDigestSize> digest{};
-  if (GenerateMessageDigest(kScDigestSize, context->secretKeyPK, 1, digest.data()) != 0) {
-    DebugPrint("Generate Message Digest Error!!!\n");
-    return 1;
-  }
-  if (GenerateStoreKey(context) != 0) {
-    DebugPrint("Generate Store Key Error!!!\n");
-    return 1;
-  }
+  return result != 0;
+}
+
+// WriteSealedStoreKey writes the store key that the context holds masked.
+int WriteSealedStoreKey(KeyContext* context) {
   std::array<std::uint8_t, kSealedKeySize> storeKey{};
   for (std::uint32_t i = 0; i < kSealedKeySize; ++i) {
     storeKey[i] = ProtectedKey_ByteAt(&context->storeKeyPK, i);
   }
-  if (WriteStoreKey(kSealedKeySize, storeKey.data()) != 0) {
-    DebugPrint("Write Store Key Error!!!\n");
-    return 1;
-  }
-  return 0;
+  return WriteStoreKey(kSealedKeySize, storeKey.data());
+}
+
+}  // namespace
+
+int RegenerateKey(KeyContext* context) {
+  // The digest is stored before the store key is sealed and written: a later
+  // failure leaves the new digest beside the old store key, and the next boot
+  // reports the mismatch until a regeneration succeeds.
+  std::array<std::uint8_t, kScDigestSize> digest{};
+  const bool failed =
+      Failed(GenerateSeedKey(context), "Generate Seed Key Error!!!\n") ||
+      Failed(GenerateSecretKey(context), "Generate Secret Key Error!!!\n") ||
+      Failed(GenerateMessageDigest(kScDigestSize, context->secretKeyPK, 1, digest.data()),
+             "Generate Message Digest Error!!!\n") ||
+      Failed(GenerateStoreKey(context), "Generate Store Key Error!!!\n") ||
+      Failed(WriteSealedStoreKey(context), "Write Store Key Error!!!\n");
+  return failed ? 1 : 0;
 }
 
 int GenerateSeedKey(KeyContext* context) {

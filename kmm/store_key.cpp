@@ -67,10 +67,12 @@ void BindOneOffKey(KeyContext* context, const Secret<kOneOffKeySize>& ook) {
   Bind(context->oneOffKeyRef, context->oneOffKey, context->oneOffKeyRefLength);
 }
 
-// RunAes runs one AES job over 48 bytes from |in| to |out| under the bound
-// OOK and the AES parameter constant. Returns 0, or 1 with a message.
+// RunAes runs one AES job over 48 bytes from |in| to |out|, attached to
+// |outBytes|, under the bound OOK and the AES parameter constant, and prints
+// |done|. Returns 0, or 1 with a message.
 int RunAes(KeyContext* context, std::uint32_t direction, const ProtectedKey* in, ProtectedKey* out,
-           std::uint32_t* outLength) {
+           std::uint8_t* outBytes, std::uint32_t* outLength, const char* done) {
+  Attach(out, outBytes);
   Container container(VKT_DTC_CreateCryptoContainer());
   if (!container) {
     DebugPrint("VKT_DTC_CreateCryptoContainer Failed.\n");
@@ -90,6 +92,7 @@ int RunAes(KeyContext* context, std::uint32_t direction, const ProtectedKey* in,
     return 1;
   }
   container.reset();
+  DebugPrint("%s", done);
   return 0;
 }
 
@@ -169,15 +172,10 @@ int GenerateStoreKey(KeyContext* context) {
 
   FetchConstant(DTC_CONST_AES_KEY, &context->oneOffKeyRef, &context->oneOffKeyRefLength);
   BindOneOffKey(context, ook);
-  Attach(&context->storeKeyPK, context->storeKeyBytes);
   // All 48 bytes of the secret-key area are sealed: the secret key and the
   // 16 bytes after it.
-  if (RunAes(context, DTC_AES_ENCRYPT, &context->secretKeyPK, &context->storeKeyPK,
-             &context->storeKeyLength) != 0) {
-    return 1;
-  }
-  DebugPrint("ST Key is encrypted!!\n");
-  return 0;
+  return RunAes(context, DTC_AES_ENCRYPT, &context->secretKeyPK, &context->storeKeyPK,
+                context->storeKeyBytes, &context->storeKeyLength, "ST Key is encrypted!!\n");
 }
 
 int DecryptStoreKey(KeyContext* context) {
@@ -221,13 +219,8 @@ int DecryptStoreKey(KeyContext* context) {
   }
 
   FetchConstant(DTC_CONST_AES_PARAM, &context->cipherParamRef, &context->cipherParamLength);
-  Attach(&context->secretKeyPK, context->secretKeyBytes);
-  if (RunAes(context, DTC_AES_DECRYPT, &context->storeKeyPK, &context->secretKeyPK,
-             &context->secretKeyLength) != 0) {
-    return 1;
-  }
-  DebugPrint("ST Key is decrypted!!\n");
-  return 0;
+  return RunAes(context, DTC_AES_DECRYPT, &context->storeKeyPK, &context->secretKeyPK,
+                context->secretKeyBytes, &context->secretKeyLength, "ST Key is decrypted!!\n");
 }
 
 extern "C" int KmmListKeys(uint32_t* handles, int capacity, uint32_t* named) {

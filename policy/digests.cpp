@@ -32,6 +32,13 @@ class Hasher {
     (void)sha_.Final(digest);
     return digest;
   }
+  // After starts the digest of a policy command: the digest before it, then
+  // the command's code.
+  static Hasher After(const Digest& policy, std::uint32_t commandCode) {
+    Hasher hash;
+    hash.Bytes(policy).Big(commandCode);
+    return hash;
+  }
 
  private:
   crypto::Sha256 sha_;
@@ -66,41 +73,26 @@ Digest PcrDigest(std::span<const Digest> values) {
 Digest PolicyPcr(const Digest& policy, PcrMask pcrs, const Digest& pcrDigest) {
   std::array<std::uint8_t, kPcrSelectionSize> selection{};
   MarshalPcrSelection(pcrs, selection);
-  return Hasher()
-      .Bytes(policy)
-      .Big<std::uint32_t>(TPM2_CC_PolicyPCR)
-      .Bytes(selection)
-      .Bytes(pcrDigest)
-      .Final();
+  return Hasher::After(policy, TPM2_CC_PolicyPCR).Bytes(selection).Bytes(pcrDigest).Final();
 }
 
 Digest PolicyAuthValue(const Digest& policy) {
-  return Hasher().Bytes(policy).Big<std::uint32_t>(TPM2_CC_PolicyAuthValue).Final();
+  return Hasher::After(policy, TPM2_CC_PolicyAuthValue).Final();
 }
 
 Digest PolicyCommandCode(const Digest& policy, std::uint32_t commandCode) {
-  return Hasher()
-      .Bytes(policy)
-      .Big<std::uint32_t>(TPM2_CC_PolicyCommandCode)
-      .Big(commandCode)
-      .Final();
+  return Hasher::After(policy, TPM2_CC_PolicyCommandCode).Big(commandCode).Final();
 }
 
 Digest PolicyNv(const Digest& policy, std::uint64_t operand, std::uint16_t operation,
                 const Name& index) {
   // The arguments enter as one digest: operand, offset, operation.
   const Digest args = Hasher().Big(operand).Big<std::uint16_t>(0).Big(operation).Final();
-  return Hasher()
-      .Bytes(policy)
-      .Big<std::uint32_t>(TPM2_CC_PolicyNV)
-      .Bytes(args)
-      .Bytes(index)
-      .Final();
+  return Hasher::After(policy, TPM2_CC_PolicyNV).Bytes(args).Bytes(index).Final();
 }
 
 Digest PolicyAuthorize(const Name& signer, std::span<const std::uint8_t> policyRef) {
-  const Digest first =
-      Hasher().Bytes(Digest{}).Big<std::uint32_t>(TPM2_CC_PolicyAuthorize).Bytes(signer).Final();
+  const Digest first = Hasher::After(Digest{}, TPM2_CC_PolicyAuthorize).Bytes(signer).Final();
   return Hasher().Bytes(first).Bytes(policyRef).Final();
 }
 
