@@ -8,8 +8,6 @@
 #include "tpm/chain.h"
 #include "util/debug_print.h"
 #include "util/hex.h"
-#include "util/io.h"
-#include "util/owned.h"
 #include "util/paths.h"
 #include "util/status.h"
 #include "verdict/event_file.h"
@@ -43,28 +41,14 @@ bool Connected(BootTpm& tpm) {
 }
 
 #if KEYMGR_SIGNED_BUILD
-// ReadPolicy reads the release's signed policy, whose counter approval a
-// sealed program's move needs.
-std::optional<policy::PolicyFile> ReadPolicy() {
-  const File stream = OpenFile(kPolicyPath, "r");
-  HeapBytes bytes;
-  std::size_t size = 0;
-  policy::PolicyFile file;
-  if (!stream || !ReadWhole(stream.get(), policy::kPolicyFileSize, bytes, &size) ||
-      !policy::DecodePolicyFile({bytes.get(), size}, &file).ok()) {
-    LogErrno(kPolicyPath);
-    return std::nullopt;
-  }
-  return file;
-}
-
 // RaiseFloor moves the release counter up to the release just checked.
 void RaiseFloor(BootTpm& tpm, unsigned pcr, std::uint64_t release) {
-  const std::optional<policy::PolicyFile> file =
-      VendorKey().empty() ? std::optional<policy::PolicyFile>(policy::PolicyFile{}) : ReadPolicy();
-  if (!file ||
-      !tpm::RaiseReleaseFloor(tpm.connection, VendorKey(), static_cast<int>(pcr), release,
-                              VendorKey().empty() ? nullptr : &*file)
+  policy::PolicyFile file;
+  if (!VendorKey().empty() && !policy::ReadPolicyFile(&file).ok()) {
+    return;
+  }
+  if (!tpm::RaiseReleaseFloor(tpm.connection, VendorKey(), static_cast<int>(pcr), release,
+                              VendorKey().empty() ? nullptr : &file)
            .ok()) {
     LogRefused("move of the release counter");
   }

@@ -4,6 +4,9 @@
 #include <cstring>
 
 #include "util/endian.h"
+#include "util/io.h"
+#include "util/owned.h"
+#include "util/paths.h"
 
 namespace keymgr::policy {
 
@@ -23,6 +26,16 @@ void EncodePolicyFile(const PolicyFile& file, std::span<std::uint8_t, kPolicyFil
   std::copy(file.keySignature.begin(), file.keySignature.end(), out.begin() + 84);
   std::copy(file.counterSignature.begin(), file.counterSignature.end(),
             out.begin() + 84 + kRsaSignatureSize);
+}
+
+Status ReadPolicyFile(PolicyFile* file) {
+  const File stream = OpenFile(kPolicyPath, "r");
+  HeapBytes bytes;
+  std::size_t size = 0;
+  if (!stream || !ReadWhole(stream.get(), kPolicyFileSize, bytes, &size)) {
+    return ErrnoFailure(kPolicyPath);
+  }
+  return DecodePolicyFile({bytes.get(), size}, file);
 }
 
 Status DecodePolicyFile(std::span<const std::uint8_t> bytes, PolicyFile* file) {

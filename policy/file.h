@@ -43,6 +43,10 @@ struct PolicyFile {
 // EncodePolicyFile lays |file| out as the policy file holds it.
 void EncodePolicyFile(const PolicyFile& file, std::span<std::uint8_t, kPolicyFileSize> out);
 
+// ReadPolicyFile reads and decodes the release's policy file,
+// /quorvan/hidden/keymgr.policy.
+Status ReadPolicyFile(PolicyFile* file);
+
 // DecodePolicyFile reads |bytes|, which must be a whole policy file of this
 // format version selecting PCRs of 0 to 23 only. The signatures are left to
 // the TPM.

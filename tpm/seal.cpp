@@ -11,26 +11,11 @@
 #include "tpm/commands.h"
 #include "tpm/fragment.h"
 #include "tpm/keys.h"
-#include "util/io.h"
-#include "util/owned.h"
-#include "util/paths.h"
 #include "util/secure.h"
 
 namespace keymgr::tpm {
 
 namespace {
-
-// ReadPolicyFile reads the release's signed policy, which a sealed key
-// follows.
-Status ReadPolicyFile(policy::PolicyFile* file) {
-  const File stream = OpenFile(kPolicyPath, "r");
-  HeapBytes bytes;
-  std::size_t size = 0;
-  if (!stream || !ReadWhole(stream.get(), policy::kPolicyFileSize, bytes, &size)) {
-    return ErrnoFailure(kPolicyPath);
-  }
-  return policy::DecodePolicyFile({bytes.get(), size}, file);
-}
 
 // StartUnsealSession starts the session that carries the decryption. For a
 // plain key it is bound to the key: its session key comes from the key's
@@ -45,7 +30,7 @@ Status StartUnsealSession(Connection& tpm, ESYS_TR key, ESYS_TR* session) {
     return StartSession(tpm, ESYS_TR_NONE, key, session, TPM2_SE_HMAC);
   }
   policy::PolicyFile file;
-  if (Status status = ReadPolicyFile(&file); !status.ok()) {
+  if (Status status = policy::ReadPolicyFile(&file); !status.ok()) {
     return status;
   }
   if (Status status = StartSaltedSession(tpm, TPM2_SE_POLICY, session); !status.ok()) {
