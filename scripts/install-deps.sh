@@ -12,6 +12,8 @@
 #   fuzz     build, and clang with libFuzzer
 #   package  build, and the Debian packaging tools
 #   bench    test's TPM tools and GoogleTest, and GNU time
+#   vm       package, swtpm, QEMU for ARM, U-Boot for QEMU, and the tools
+#            that make the VM test's images and disks (scripts/vm-test.sh)
 #   all      every job's, and devscripts: what CI runs
 # Further PACKAGEs (a cross compiler, say) are installed with them. Without a
 # JOB (the first word not a job's name) it installs what all does.
@@ -29,6 +31,8 @@ declare -A jobs=(
   [fuzz]="${build[*]} clang libclang-rt-14-dev"
   [package]="${build[*]} ${packaging[*]}"
   [bench]="${build[*]} ${tpm[*]} swtpm-tools openssl libgtest-dev time"
+  [vm]="${build[*]} ${tpm[*]} swtpm-tools ${packaging[*]} qemu-system-arm cpio e2fsprogs
+        u-boot-qemu u-boot-tools mtools dosfstools fdisk"
 )
 jobs[all]="${jobs[*]} devscripts"
 

@@ -22,10 +22,11 @@
 # ROOT.
 keymgr_in() {
   _root=$1
-  shift
+  _program=$2
+  shift 2
   _interp=$(cat /etc/keymgr/interp)
   _libs=$(cat /etc/keymgr/libs)
-  chroot "$_root" "/run/keymgr$_interp" --library-path "$_libs" "/run/keymgr$1" "$@"
+  chroot "$_root" "/run/keymgr$_interp" --library-path "$_libs" "/run/keymgr$_program" "$@"
 }
 
 keymgr_prove_root() {

@@ -6,12 +6,16 @@
 # keymgr-eeprom.
 
 # shellcheck disable=SC2034 # the rows use these
-sealed=${vmtest_sealed:-}
 events=/quorvan/spool/log/keymgr.events
 hidden=/quorvan/hidden
 log=/quorvan/spool/log/keymgr.log
 # What the test keeps on the disk between boots, beside /quorvan.
 state=/disk/vmtest
+# The chain rows: the PCR values that the vendor's policy of the release on
+# the disk binds, as keymgr-mkpolicy printed them on the host.
+policy_pcr4=${vmtest_pcr4:-}
+policy_pcr12=${vmtest_pcr12:-}
+policy_pcr14=${vmtest_pcr14:-}
 
 ok() { echo "vmtest: ok $*"; }
 bad() { echo "vmtest: FAIL $*"; }
@@ -29,6 +33,10 @@ now_ms() {
 }
 
 hex_of() { od -An -tx1 -v "$@" | tr -d ' \n'; }
+
+# pcr N: PCR N of the TPM's SHA-256 bank as the kernel reads it, in
+# lower-case hex.
+pcr() { tr 'A-F' 'a-f' <"/sys/class/tpm/tpm0/pcr-sha256/$1"; }
 
 # log_is LINES...: the boot status log holds exactly these lines.
 log_is() {
@@ -108,4 +116,20 @@ regenerate_and_boot() {
   run "boot proof (kmm-host 1 1)" 0 kmm-host 1 1
   check "boot proof logs DT=OK" [ "$(tail -n 1 "$log")" = DT=OK ]
   keys_are "after the regeneration" named
+}
+
+# events_are VERDICT: the event log, as keymgr-eventlog reads it, is one
+# boot's: the verdict VERDICT, then the separator of the boot's first key
+# proof; and it replays to PCR 14 as the kernel reads it.
+events_are() {
+  local records status=0
+  keymgr-eventlog "$events" --pcr 14 --expect "$(pcr 14)" >/tmp/events.out 2>&1 || status=$?
+  records=$(sed -n 's/^[0-9] pcr 14 sha256:[0-9a-f]* //p' /tmp/events.out | paste -sd' ')
+  if [ $status = 0 ] && [ "$records" = "$1 separator" ]; then
+    ok "event log: $records, replayed to PCR 14 as read"
+  else
+    bad "event log: ${records:-nothing} (keymgr-eventlog exits $status), expected: $1 separator," \
+      "replayed to PCR 14 as read"
+    tail -n 3 /tmp/events.out
+  fi
 }
