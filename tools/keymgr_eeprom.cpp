@@ -6,7 +6,7 @@
 //   keymgr-eeprom write OFFSET HEX      HEX is a string of hex digit pairs
 //   keymgr-eeprom write REGION HEX      exactly the region's length
 // OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal; REGION is
-// store-key, sfe-conf, control or sc-digest.
+// store-key, sfe-conf, control, sc-digest or storage-key-pin.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -38,7 +38,7 @@ int Usage() {
                      "usage: keymgr-eeprom init | read OFFSET LENGTH | read REGION |\n"
                      "       keymgr-eeprom write OFFSET HEX | write REGION HEX\n"
                      "  OFFSET and LENGTH are decimal or 0x-prefixed hexadecimal;\n"
-                     "  REGION is store-key, sfe-conf, control or sc-digest\n");
+                     "  REGION is store-key, sfe-conf, control, sc-digest or storage-key-pin\n");
   return kErrorStatus;
 }
 
