@@ -258,20 +258,24 @@ void TheTpmUnreachableAtTheBootRun(Chain& /*chain*/) {
   EXPECT_EQ(Proved(), "") << "the TPM came back, the verdict did not";
 }
 
-void ANewReleaseWithANewPolicyNeedsNoReseal(Chain& chain) {
-  Release(chain.base_ + 1, "B");
-  EXPECT_EQ(Chain::Boot("B").status, 0);
+// BootsRelease lays out release |n| of |image|, boots it and proves the key,
+// which moves the counter to |n|.
+void BootsRelease(std::uint64_t n, const std::string& image) {
+  Release(n, image);
+  ASSERT_EQ(Chain::Boot(image).status, 0);
   EXPECT_NE(Proved(), "");
-  EXPECT_EQ(Floor(), chain.base_ + 1);
+  EXPECT_EQ(Floor(), n);
+}
+
+void ANewReleaseWithANewPolicyNeedsNoReseal(Chain& chain) {
+  BootsRelease(chain.base_ + 1, "B");
 }
 
 // Release 5 good, 6 good, 5 again refused, 7 good.
 void AnOlderReleasePutBack(Chain& chain) {
   ASSERT_EQ(Chain::Boot("A").status, 0);
   EXPECT_EQ(Floor(), chain.base_);
-  Release(chain.base_ + 1, "A");
-  ASSERT_EQ(Chain::Boot("A").status, 0);
-  EXPECT_NE(Proved(), "");
+  BootsRelease(chain.base_ + 1, "A");
   Restore(chain.first_);
   const RunResult old = Chain::Boot("A");
   EXPECT_EQ(old.status, 1);
@@ -281,10 +285,7 @@ void AnOlderReleasePutBack(Chain& chain) {
             std::string::npos)
       << old.out;
   EXPECT_EQ(Proved(), "");
-  Release(chain.base_ + 2, "A");
-  ASSERT_EQ(Chain::Boot("A").status, 0);
-  EXPECT_NE(Proved(), "");
-  EXPECT_EQ(Floor(), chain.base_ + 2);
+  BootsRelease(chain.base_ + 2, "A");
 }
 
 // A boot cut short at each command of the counter's move (the bus hung up,
