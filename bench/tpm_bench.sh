@@ -6,7 +6,8 @@
 # build's kmm-host can make one. A build with KEYMGR_MEASURE_PCR (and
 # KEYMGR_SEAL_TO_VERDICT) is measured as a device boots it: each boot proof
 # follows a power cycle, the firmware's measurement of a boot image into
-# PCR 4, and keymgr's boot run, whose own commands are counted too. A signed
+# PCR 4, and keymgr's boot run, whose own commands are counted too; a signed
+# build's boot run is counted again when it moves the release counter. A signed
 # or sealed build must be configured with the test keys
 # (tests/cli/data/digest_key.pub.pem, tests/policy/data/vendor_key.pub.pem):
 # the bench signs its release with their private halves.
@@ -48,16 +49,22 @@ echo "$root/quorvan/listed" >"$hidden/keymgr.list"
 # PCR 4 once the firmware measured the boot image "image".
 image_pcr=$( (head -c 32 /dev/zero; printf image | openssl dgst -sha256 -binary) |
   openssl dgst -sha256 -r | cut -d' ' -f1)
-if [ -n "$(build_setting "$build" KEYMGR_DIGEST_PUBKEY)" ]; then
+signed=$(build_setting "$build" KEYMGR_DIGEST_PUBKEY)
+# sign_release N: the digest file of release N, and its policy in a sealed
+# build.
+sign_release() {
   "$build/tools/keymgr-mkdigest" --root / --manifest "$hidden/keymgr.list" \
-    --output "$hidden/keymgr.cb" --key tests/cli/data/digest_key.pem --counter 1
+    --output "$hidden/keymgr.cb" --key tests/cli/data/digest_key.pem --counter "$1"
+  if [ "$(build_setting "$build" KEYMGR_SEAL_TO_VERDICT)" = ON ]; then
+    "$build/tools/keymgr-mkpolicy" --key tests/policy/data/vendor_key.pem --release "$1" \
+      --verdict-pcr "$(build_setting "$build" KEYMGR_MEASURE_PCR)" --pcr "4=$image_pcr" \
+      --output "$hidden/keymgr.policy" >/dev/null
+  fi
+}
+if [ -n "$signed" ]; then
+  sign_release 1
 else
   "$build/cli/keymgr" hash
-fi
-if [ "$(build_setting "$build" KEYMGR_SEAL_TO_VERDICT)" = ON ]; then
-  "$build/tools/keymgr-mkpolicy" --key tests/policy/data/vendor_key.pem --release 1 \
-    --verdict-pcr "$(build_setting "$build" KEYMGR_MEASURE_PCR)" --pcr "4=$image_pcr" \
-    --output "$hidden/keymgr.policy" >/dev/null
 fi
 
 # before_boot readies a boot proof of a measured build, whose key may need
@@ -117,4 +124,18 @@ report() {
 report "no SRK:  "
 if "$host" srk 2>/dev/null; then
   report "with SRK:"
+fi
+
+# A signed build's boot run after an update to the next release, which moves
+# the release counter up by one; each timed run boots a release of its own.
+if [ -n "$signed" ]; then
+  sign_release 2
+  power_on
+  echo "release +1 keymgr:    $(cost "$build/cli/keymgr")"
+  moved=$(for release in $(seq 3 $((runs + 2))); do
+    sign_release "$release"
+    power_on
+    wall_ms "$build/cli/keymgr"
+  done | median)
+  echo "release +1 keymgr:    median $moved ms over $runs runs"
 fi
