@@ -2,8 +2,8 @@
 #include <cstring>
 #include <optional>
 
-#include "integrity/internal.h"
 #include "crypto/hash.h"
+#include "integrity/internal.h"
 #include "integrity/signature.h"
 #include "keymgr_digest_key.h"
 #include "util/debug_print.h"
