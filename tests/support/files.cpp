@@ -64,4 +64,12 @@ std::string Hex(std::string_view bytes) {
   return text;
 }
 
+std::string LowerHex(std::string_view bytes) {
+  std::string text;
+  for (unsigned char c : bytes) {
+    text += {"0123456789abcdef"[c >> 4], "0123456789abcdef"[c & 0x0F]};
+  }
+  return text;
+}
+
 }  // namespace keymgr::test

@@ -27,6 +27,9 @@ void Require(bool holds);
 std::string FromHex(std::string_view hex);
 
 // Hex renders bytes as upper-case "%02X " groups, the way the programs print.
+// LowerHex renders them as lower-case digits alone, as tpm2-tools and
+// keymgr-eventlog write and take digests.
 std::string Hex(std::string_view bytes);
+std::string LowerHex(std::string_view bytes);
 
 }  // namespace keymgr::test

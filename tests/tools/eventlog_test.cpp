@@ -4,9 +4,7 @@
 // other log, or wrong arguments.
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <array>
-#include <cctype>
 
 #include "support/sandbox.h"
 #include "verdict/event_log.h"
@@ -31,19 +29,11 @@ std::string Extend(const std::string& pcr, const Event& event) {
   return t::Sha256(pcr + Digest(event));
 }
 
-// HexOf is |bytes| in lower-case hex, as keymgr-eventlog prints them.
-std::string HexOf(const std::string& bytes) {
-  std::string hex = t::Hex(bytes);
-  std::erase(hex, ' ');
-  std::transform(hex.begin(), hex.end(), hex.begin(), [](char c) { return std::tolower(c); });
-  return hex;
-}
-
 TEST(Eventlog, ReplaysOneBootOfOnePcr) {
   const Event ok = VerdictEvent(0, 14, Verdict::kOk), fail = VerdictEvent(0, 14, Verdict::kFail);
   const Event separator = SeparatorEvent(1, 14);
   const std::string zeros(32, '\0'), booted = Extend(zeros, ok);
-  const std::string good = HexOf(Extend(booted, separator)), okOnly = HexOf(booted);
+  const std::string good = t::LowerHex(Extend(booted, separator)), okOnly = t::LowerHex(booted);
   Event edited = ok, stamped = separator;
   edited.digest = fail.digest;
   stamped.digest = ok.digest;
@@ -61,7 +51,7 @@ TEST(Eventlog, ReplaysOneBootOfOnePcr) {
       {"no value to match", Line(fail) + Line(separator), {}, 0},
       {"another value", Line(ok), {"--pcr", "14", "--expect", good}, 1},
       {"a log of another PCR", Line(ok) + Line(separator), {"--pcr", "15", "--expect", good}, 1},
-      {"two verdicts", Line(fail) + Line(VerdictEvent(1, 14, Verdict::kOk)), {"--pcr", "14", "--expect", HexOf(Extend(Extend(zeros, fail), ok))}, 2},
+      {"two verdicts", Line(fail) + Line(VerdictEvent(1, 14, Verdict::kOk)), {"--pcr", "14", "--expect", t::LowerHex(Extend(Extend(zeros, fail), ok))}, 2},
       {"separator first", Line(SeparatorEvent(0, 14)) + Line(VerdictEvent(1, 14, Verdict::kOk)), {}, 2},
       {"two separators", Line(ok) + Line(separator) + Line(SeparatorEvent(2, 14)), {}, 2},
       {"recnums out of order", Line(VerdictEvent(1, 14, Verdict::kOk)), {}, 2},
@@ -85,8 +75,8 @@ TEST(Eventlog, ReplaysOneBootOfOnePcr) {
     const auto run = t::Run(argv);
     EXPECT_EQ(run.status, row.status) << run.err;
     if (&row == rows) {
-      EXPECT_EQ(run.out, "0 pcr 14 sha256:" + HexOf(Digest(ok)) +
-                             " BN=OK\n1 pcr 14 sha256:" + HexOf(Digest(separator)) +
+      EXPECT_EQ(run.out, "0 pcr 14 sha256:" + t::LowerHex(Digest(ok)) +
+                             " BN=OK\n1 pcr 14 sha256:" + t::LowerHex(Digest(separator)) +
                              " separator\npcr 14 replays to sha256:" + good + "\n");
     }
   }

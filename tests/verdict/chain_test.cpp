@@ -36,20 +36,13 @@ const std::string kA = InRoot("/d/a"), kEvents = kEventLogPath;
 constexpr auto kVendor = *HexBytes<256>(KEYMGR_TEST_VENDOR_MODULUS);
 constexpr std::uint32_t kStartAuthSession = 0x176, kRsaDecrypt = 0x159, kRhNull = 0x40000007;
 
-std::string Lower(std::string_view bytes) {
-  std::string hex(2 * bytes.size(), '0');
-  HexEncode({reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()}, hex.data(),
-            HexCase::kLower);
-  return hex;
-}
-
 std::string Text(const verdict::PcrValue& value) {
   return {reinterpret_cast<const char*>(value.data()), value.size()};
 }
 
 // Firmware extends PCR 4 with the digest of the boot image it starts.
 void Firmware(const std::string& image) {
-  ASSERT_EQ(Tpm2({"tpm2_pcrextend", "4:sha256=" + Lower(Sha256(image))}).status, 0);
+  ASSERT_EQ(Tpm2({"tpm2_pcrextend", "4:sha256=" + LowerHex(Sha256(image))}).status, 0);
 }
 
 // Release lays out release |n| for the boot image |image|: a listed file,
@@ -64,7 +57,7 @@ Files Release(std::uint64_t n, const std::string& image) {
                  std::to_string(n)})
                 .status,
             0);
-  const std::string pcr4 = Lower(Sha256(std::string(32, '\0') + Sha256(image)));
+  const std::string pcr4 = LowerHex(Sha256(std::string(32, '\0') + Sha256(image)));
   EXPECT_EQ(Run({KEYMGR_TEST_MKPOLICY_BIN, "--key", kSource + "/tests/policy/data/vendor_key.pem",
                  "--release", std::to_string(n), "--verdict-pcr", "14", "--pcr", "4=" + pcr4,
                  "--output", kPolicyPath})
@@ -216,7 +209,7 @@ void KeymgrSkippedAndTheGoodValueExtendedByHand(Chain& /*chain*/) {
   PowerCycleTpm();
   Firmware("A without keymgr");
   Tpm2({"tpm2_pcrextend",
-        "14:sha256=" + Lower(Text(verdict::VerdictDigest(verdict::Verdict::kOk)))});
+        "14:sha256=" + LowerHex(Text(verdict::VerdictDigest(verdict::Verdict::kOk)))});
   EXPECT_EQ(Proved(), "");
 }
 
@@ -384,7 +377,7 @@ void TheEventLogSaysWhatWasChecked(Chain& chain) {
   EXPECT_EQ(after.st_mode & 07777, 0644u);
   const std::string events = *ReadFile(kEvents);
   for (const std::string& file : {chain.first_[kManifestPath], chain.first_[kDigestFilePath]}) {
-    EXPECT_NE(events.find(Lower(Sha256(file))), std::string::npos) << events;
+    EXPECT_NE(events.find(LowerHex(Sha256(file))), std::string::npos) << events;
   }
   EXPECT_NE(events.find("\"release\":" + std::to_string(chain.base_) + "}"), std::string::npos);
 }
