@@ -1,6 +1,8 @@
 // The module's flows over the fake EEPROM and key manager of the test support,
 // and the real crypto services behind --wrap wrappers that inject faults and
 // count containers.
+#include <sys/prctl.h>
+
 #include <gtest/gtest.h>
 #include <kmm/kmm.h>
 
@@ -15,7 +17,6 @@
 #include "support/sandbox.h"
 #include "util/paths.h"
 
-namespace keymgr::test {
 namespace {
 
 // The |at|-th call (from 1) of |call| fails: a create returns no container;
@@ -26,28 +27,25 @@ struct CryptoFault {
   std::uint32_t code = 0, length = 0;
 } g_fault;
 std::array<int, 3> g_calls{};
-int g_live = 0;  // containers created and not yet destroyed
+int g_live = 0;      // containers created and not yet destroyed
+int g_dumpable = 0;  // whether a crypto call ran while a core could be taken
 
 bool Hit(int call) {
   return ++g_calls[call] == g_fault.at && call == g_fault.call;
 }
-// Faulty takes the |result| of a real call: a faulty one returns |code|, or
-// with code 0 reports |length| as output.
+// Faulty takes the |result| of a real call: a faulty one reports |length| as
+// output and returns |code|, or with code 0 the result.
 std::uint32_t Faulty(int call, std::uint32_t* outLength, std::uint32_t result) {
+  g_dumpable |= prctl(PR_GET_DUMPABLE);
   if (!Hit(call)) {
     return result;
   }
-  if (g_fault.code == 0) {
-    *outLength = g_fault.length;
-  }
+  *outLength = g_fault.length;
   return g_fault.code != 0 ? g_fault.code : result;
 }
 ProtectedKey g_dmsetup;  // the disk-mapper tool's expected digest
 
 }  // namespace
-}  // namespace keymgr::test
-
-using namespace keymgr::test;
 
 extern "C" {
 CryptoContainer __real_VKT_DTC_CreateCryptoContainer(void);
@@ -103,6 +101,8 @@ void Reset() {
   KeyManager().Reset();
   g_fault = {};
   g_calls = {};
+  prctl(PR_SET_DUMPABLE, 1);
+  g_dumpable = 0;
 }
 
 // Call runs KeyManage, keeps its result in g_context and returns what it
@@ -136,7 +136,9 @@ std::string State() {
   return s + std::to_string(KeyManager().keys.size());
 }
 
-// A regeneration replaces the temporary names that a killed one left.
+// A regeneration replaces the temporary names that a killed one left. A core
+// taken once the flows hold key material, or as the program exits, would
+// carry it: the kernel is told to write none before the first crypto call.
 TEST(KmmFlow, RegenerationIsProvedAtBoot) {
   Reset();
   for (const char* name : {"/.keymgr.cs.new", "/.keymgr.hddpwd.new", "/.keymgr.ook.new"}) {
@@ -155,6 +157,8 @@ TEST(KmmFlow, RegenerationIsProvedAtBoot) {
                 "SC Digest Test Success [EEPROM]!!\nSC Digest Test Success [HDD]!!\n\n" +
                 kLine + "\n End KMM : T\n" + kLine + "\n\n\n\n");
   EXPECT_EQ(Text(kBootLogPath), "-");
+  EXPECT_EQ(g_dumpable, 0);
+  EXPECT_EQ(prctl(PR_GET_DUMPABLE), 0);
   // Another option is rejected, and the context is zeroed all the same.
   const auto* bytes = reinterpret_cast<const std::uint8_t*>(g_context);
   EXPECT_EQ(Call(2), "Key manage option invalid(2)!!\n");
