@@ -179,8 +179,7 @@ const std::string kValues = "Read Store Key but values are error [Retry:";
 std::string Retries(const std::string& line) {
   return line + "2]!!!\n" + line + "1]!!!\n" + line + "0]!!!\n";
 }
-constexpr std::uint32_t kDigestEnd = kScDigestOffset + kScDigestLength;
-constexpr std::uint32_t kLast = kStoreKeyOffset + kStoreKeyLength - 1;
+constexpr std::uint32_t kLast = kStoreKeyOffset + kStoreKeyLength - 1;  // its last byte
 // What a regeneration leaves: nothing, the digest, or also the key files. A
 // key whose identity never reached the disk is evicted again.
 const std::string kNone = "- - - - - - 0", kDigestOnly = "- set 32 - - - 0";
@@ -215,7 +214,7 @@ const Row kRows[] = {
     {"secret key hash fails", 3, [] { g_fault = {kHash, 1, 0xD7C00007}; }, "GetHash Failed. nRes=0xd7c00007\n" + kSecret, kNone},
     {"secret key hash of 33 bytes", 3, [] { g_fault = {kHash, 1, 0, 33}; }, "GetHash Failed. nRes=0x00000000\n" + kSecret, kNone},
     {"no container for the digest", 3, [] { g_fault = {kCreate, 2, 0}; }, "Failed. nRes=0x00000000\n" + kDigest, kNone},
-    {"digest not written to EEPROM", 3, [] { Eeprom().fault = {kScDigestOffset, kDigestEnd, 1}; }, "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
+    {"digest not written to EEPROM", 3, [] { Eeprom().fault = {kScDigestOffset, kScDigestOffset + kScDigestLength, 1}; }, "Write error - Message Digest to EEPROM !!!\n" + kDigest, kNone},
     // A draw that fails stops the regeneration: nothing is sealed under the
     // built-in initial one-off key, a previous identity or zeros.
     {"one-off key not drawn", 3, [] { KeyManager().fail[kRandom] = 1; }, "Failed to generate one_off_key by TPM.\n" + kStore, kDigestOnly},

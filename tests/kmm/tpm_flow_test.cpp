@@ -154,14 +154,15 @@ TEST_P(FailedCommands, EndInTimeAndLeaveOneKey) {
   }
 }
 const FaultRow kFaults[] = {
-    {"regeneration unanswered at its first 8 commands", Fault::kWithhold, KMM_OPTION_REGENERATE, 1,
-     8},
+    // clang-format off
+    {"regeneration unanswered at its first 8 commands", Fault::kWithhold, KMM_OPTION_REGENERATE, 1, 8},
     {"regeneration unanswered at a later command", Fault::kWithhold, KMM_OPTION_REGENERATE, 9},
     {"regeneration answered with an error", Fault::kError, KMM_OPTION_REGENERATE},
     {"regeneration hung up on", Fault::kHangUp, KMM_OPTION_REGENERATE},
     {"boot unanswered", Fault::kWithhold, KMM_OPTION_NORMAL_BOOT},
     {"boot answered with an error", Fault::kError, KMM_OPTION_NORMAL_BOOT},
     {"boot hung up on", Fault::kHangUp, KMM_OPTION_NORMAL_BOOT},
+    // clang-format on
 };
 INSTANTIATE_TEST_SUITE_P(Rows, FailedCommands, testing::ValuesIn(kFaults), RowName());
 
