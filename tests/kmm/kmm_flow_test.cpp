@@ -298,7 +298,8 @@ TEST(KmmFlow, SeedKeyIsUnguessableWhetherOrNotTheHostSeeds) {
 }
 
 // The disk-mapper tool check fails, quietly, when only the last byte of the
-// tool's digest differs from the expected one.
+// tool's digest differs from the expected one. (A tool that matches, and one
+// that cannot be opened, are the hostile files' end-to-end rows.)
 TEST(KmmFlow, DmsetupDigestFailsQuietlyOnItsLastByte) {
   static std::string tool = *ReadFile(KEYMGR_TEST_SOURCE_DIR "/tests/kmm/data/dmsetup"),
                      expected = Sha256(tool);
