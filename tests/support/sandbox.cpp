@@ -54,10 +54,6 @@ void MakeEeprom(std::uint8_t control, std::uint32_t sfeConf) {
 
 const std::vector<std::string> kEmulator{KEYMGR_TEST_EMULATOR};
 
-bool UnderEmulator() {
-  return !kEmulator.empty();
-}
-
 // Emulated puts the emulator of a cross build in front of the first argument
 // that is a program of this build, also behind a launcher such as strace.
 std::vector<std::string> Emulated(std::vector<std::string> argv) {

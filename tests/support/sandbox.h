@@ -35,10 +35,6 @@ struct RunResult {
   std::string out, err;
 };
 
-// UnderEmulator tells whether the build's programs run under an emulator
-// (a cross build under qemu-user).
-bool UnderEmulator();
-
 // Run starts argv[0] with the arguments, stdin on /dev/null, and waits.
 RunResult Run(const std::vector<std::string>& argv);
 

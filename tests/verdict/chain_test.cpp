@@ -40,8 +40,10 @@ std::string Text(const verdict::PcrValue& value) {
   return {reinterpret_cast<const char*>(value.data()), value.size()};
 }
 
-// Firmware extends PCR 4 with the digest of the boot image it starts.
-void Firmware(const std::string& image) {
+// PowerOn power-cycles the TPM, and the firmware extends PCR 4 with the
+// digest of the boot image it starts.
+void PowerOn(const std::string& image) {
+  PowerCycleTpm();
   ASSERT_EQ(Tpm2({"tpm2_pcrextend", "4:sha256=" + LowerHex(Sha256(image))}).status, 0);
 }
 
@@ -147,12 +149,10 @@ class Chain : public testing::Test {
   }
   void TearDown() override { UseSealPcr(-1); }
 
-  // Boot power-cycles the TPM, lets the firmware measure |image| and runs
-  // keymgr's boot run.
-  static RunResult Boot(const std::string& image, const std::string& program = S) {
-    PowerCycleTpm();
-    Firmware(image);
-    return test::Run({program});
+  // Boot powers on with |image| and runs keymgr's boot run.
+  static RunResult Boot(const std::string& image) {
+    PowerOn(image);
+    return test::Run({S});
   }
 
   const TpmClean clean_;
@@ -206,8 +206,7 @@ void FailRewrittenToGoodOnTheBus(Chain& /*chain*/) {
 }
 
 void KeymgrSkippedAndTheGoodValueExtendedByHand(Chain& /*chain*/) {
-  PowerCycleTpm();
-  Firmware("A without keymgr");
+  PowerOn("A without keymgr");
   Tpm2({"tpm2_pcrextend",
         "14:sha256=" + LowerHex(Text(verdict::VerdictDigest(verdict::Verdict::kOk)))});
   EXPECT_EQ(Proved(), "");
@@ -240,8 +239,7 @@ void ATpmResumedAfterAProof(Chain& /*chain*/) {
 }
 
 void TheTpmUnreachableAtTheBootRun(Chain& /*chain*/) {
-  PowerCycleTpm();
-  Firmware("A");
+  PowerOn("A");
   {
     const Away tpm;
     const RunResult run = Run({S});
@@ -290,8 +288,7 @@ void APowerCutInTheCountersMove(Chain& chain) {
   std::vector<TpmProxy::Command> sent;
   {
     Interposer bus;
-    PowerCycleTpm();
-    Firmware("A");
+    PowerOn("A");
     bus.proxy.Arm(TpmProxy::Fault::kNone, 0);
     ASSERT_EQ(Run({S}).status, 0);
     sent = bus.proxy.Sent();
@@ -306,8 +303,7 @@ void APowerCutInTheCountersMove(Chain& chain) {
     SCOPED_TRACE("cut at command " + std::to_string(cut));
     {
       Interposer bus;
-      PowerCycleTpm();
-      Firmware("A");
+      PowerOn("A");
       bus.proxy.Arm(TpmProxy::Fault::kHangUp, static_cast<int>(cut));
       Run({S});
     }
@@ -325,10 +321,7 @@ void TheCounterMovedWithoutAGoodVerdict(Chain& chain) {
   tpm::Connection tpm;
   ASSERT_TRUE(tpm::Connect(tpm, tpm::BuildOptions()).ok());
   policy::PolicyFile file;
-  const std::string bytes = *ReadFile(kPolicyPath);
-  ASSERT_TRUE(policy::DecodePolicyFile(
-                  {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()}, &file)
-                  .ok());
+  ASSERT_TRUE(policy::ReadPolicyFile(&file).ok());
   EXPECT_FALSE(tpm::RaiseReleaseFloor(tpm, kVendor, 14, chain.base_ + 5, &file).ok());
   EXPECT_EQ(Floor(), chain.base_);
 }
@@ -355,8 +348,7 @@ void TheEventLogSaysWhatWasChecked(Chain& chain) {
   ASSERT_EQ(::chown(kEvents.c_str(), 65534, 65534), 0);
   struct stat before {};
   ASSERT_EQ(::stat(kEvents.c_str(), &before), 0);
-  PowerCycleTpm();
-  Firmware("A");
+  PowerOn("A");
   const std::string trace = "/tmp/keymgr-chain-" + std::to_string(::getpid());
   ASSERT_EQ(Run(Traced({"-o", trace, "-e", "trace=openat"}, {S})).status, 0);
   std::ifstream in(trace);
