@@ -18,6 +18,7 @@
 #include "policy/boot_chain.h"
 #include "policy/pe_image.h"
 #include "support/files.h"
+#include "util/hex.h"
 
 namespace keymgr::policy {
 namespace {
@@ -30,12 +31,7 @@ Bytes Uki() {
 }
 
 std::string Hex(const Digest& digest) {
-  std::string text;
-  for (const std::uint8_t byte : digest) {
-    text += "0123456789abcdef"[byte >> 4];
-    text += "0123456789abcdef"[byte & 15];
-  }
-  return text;
+  return HexText(digest, HexCase::kLower).data();
 }
 
 Digest Authenticode(const Bytes& bytes) {
