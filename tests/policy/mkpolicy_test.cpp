@@ -1,8 +1,7 @@
-// The policy digests against the suite's swtpm, which computes them in a
-// trial session of tpm2-tools, and keymgr-mkpolicy end to end: its file
+// keymgr-mkpolicy end to end: the same inputs give the same file, which
 // decodes to what it printed, and it writes nothing when it refuses. The
-// names, PolicyNV, PolicyAuthorize and the signatures meet the TPM in the
-// chain tests, where a sealed key opens only if each is right.
+// policy digests, names and signatures meet the TPM in the chain tests, where
+// a sealed key opens only if each is right.
 #include <gtest/gtest.h>
 
 #include <array>
@@ -22,30 +21,10 @@ namespace keymgr::policy {
 namespace {
 
 using test::ReadFile;
-using test::Tpm2;
-using test::WriteFile;
 
 const std::string kTool = KEYMGR_TEST_MKPOLICY_BIN;
 const std::string kData = KEYMGR_TEST_SOURCE_DIR "/tests/policy/data/";
 constexpr auto kVendor = *HexBytes<256>(KEYMGR_TEST_VENDOR_MODULUS);
-
-template <std::size_t N>
-std::string Text(const std::array<std::uint8_t, N>& bytes) {
-  return {bytes.begin(), bytes.end()};
-}
-
-// Trial runs tpm2-tools' policy commands in a trial session and returns the
-// digest it ends with.
-std::string Trial(const std::string& dir, const std::vector<std::vector<std::string>>& commands) {
-  const std::string session = dir + "trial.ctx", digest = dir + "trial.policy";
-  EXPECT_EQ(Tpm2({"tpm2_startauthsession", "-S", session}).status, 0);
-  for (std::vector<std::string> command : commands) {
-    command.insert(command.begin() + 1, {"-S", session, "-L", digest});
-    EXPECT_EQ(Tpm2(command).status, 0) << command[0];
-  }
-  EXPECT_EQ(Tpm2({"tpm2_flushcontext", session}).status, 0);
-  return ReadFile(digest).value_or("");
-}
 
 // Argv runs keymgr-mkpolicy with good options, but |change|'s option set to
 // its value (left out when that is empty), and |extra| after them.
@@ -77,24 +56,6 @@ class Mkpolicy : public testing::Test {
   }
   const std::string dir_ = test::InRoot("/policy/");
 };
-
-TEST_F(Mkpolicy, TheTpmComputesThePcrPoliciesAsTheLibraryDoes) {
-  // PCRs 0, 4, 12 and 14 at values of their own.
-  const PcrMask mask = 1 << 0 | 1 << 4 | 1 << 12 | 1 << 14;
-  std::vector<Digest> values;
-  std::string valueFile;
-  for (const std::uint8_t fill : {0x10, 0x04, 0x00, 0x0E}) {
-    values.emplace_back().fill(fill);
-    valueFile += Text(values.back());
-  }
-  WriteFile(dir_ + "pcrs.bin", valueFile);
-  const Digest pcrDigest = PcrDigest(values);
-  const std::vector<std::string> policyPcr = {"tpm2_policypcr", "-l", "sha256:0,4,12,14", "-f",
-                                              dir_ + "pcrs.bin"};
-  EXPECT_EQ(Trial(dir_, {policyPcr}), Text(PolicyPcr(Digest{}, mask, pcrDigest)));
-  EXPECT_EQ(Trial(dir_, {policyPcr, {"tpm2_policycommandcode", "TPM2_CC_NV_Increment"}}),
-            Text(ApprovedCounterPolicy(mask, pcrDigest)));
-}
 
 TEST_F(Mkpolicy, TheSameInputsGiveTheSameFileAsPrinted) {
   const std::vector<std::string> argv = Argv(dir_ + "policy");
