@@ -30,10 +30,6 @@ Bytes Uki() {
   return Bytes(text.begin(), text.end());
 }
 
-std::string Hex(const Digest& digest) {
-  return HexText(digest, HexCase::kLower).data();
-}
-
 Digest Authenticode(const Bytes& bytes) {
   PeImage image;
   EXPECT_TRUE(ReadPeImage(bytes, &image).ok());
@@ -52,8 +48,8 @@ TEST(BootChain, TheSmallUkiGivesThePrototypesDigests) {
   // out its certificate table and the directory entry that points at it.
   UkiPcrs pcrs;
   ASSERT_TRUE(PredictUkiPcrs(uki, &pcrs).ok());
-  EXPECT_EQ(Hex(pcrs.bootImages),
-            "513cc4705c822e55680dad553078a59468980f0226be7419add9237879701ec6");
+  EXPECT_STREQ(HexText(pcrs.bootImages, HexCase::kLower).data(),
+               "513cc4705c822e55680dad553078a59468980f0226be7419add9237879701ec6");
   EXPECT_EQ(pcrs.loadOptions, Digest{});
 
   // The firmware hashes a copy padded with zeros to a multiple of 8 bytes.
