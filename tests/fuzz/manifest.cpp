@@ -34,10 +34,8 @@ constexpr char kSpaces[] = " \t\n\v\f\r";
 
 // The folder the manifest's names are read in, and the file standard output
 // goes to.
-fs::path Scratch() {
-  return fs::path(kManifestPath).parent_path().parent_path() / "fuzz-files";
-}
-const std::string kOutput = Scratch().parent_path() / "fuzz-output";
+const fs::path kScratch = fs::path(kManifestPath).parent_path().parent_path() / "fuzz-files";
+const std::string kOutput = kScratch.parent_path() / "fuzz-output";
 
 // Run runs |call| with |threads| hashing threads and returns its result,
 // what it printed, the boot status log and the digest file.
@@ -52,9 +50,7 @@ Outcome Run(int threads, int (*call)(int), int verbose = 0) {
   return {std::to_string(result), test::ReadFile(kOutput).value_or(""),
           test::ReadFile(kBootLogPath).value_or(""), test::ReadFile(kDigestFilePath).value_or("")};
 }
-int Hash(int) {
-  return HashManifest();
-}
+constexpr auto kHash = +[](int) { return HashManifest(); };
 
 // LayOut writes a manifest of entries chosen by |in|, and sets |records| to
 // the records it must give and |allHashed| to whether every entry hashes.
@@ -87,8 +83,8 @@ std::string LayOut(FuzzedDataProvider& in, const std::array<std::string, kDataFi
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fs::create_directories(fs::path(kManifestPath).parent_path());
   fs::create_directories(fs::path(kBootLogPath).parent_path());
-  fs::create_directories(Scratch() / "dir");
-  mkfifo((Scratch() / "fifo").c_str(), 0600);
+  fs::create_directories(kScratch / "dir");
+  mkfifo((kScratch / "fifo").c_str(), 0600);
   // What the runs print is compared through this file.
   return std::freopen(kOutput.c_str(), "w+", stdout) != nullptr ? 0 : 1;
 }
@@ -98,7 +94,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t siz
   // The scratch folder is the working one for the run; libFuzzer's, which
   // resolves its corpus and artifact paths, is restored afterwards.
   const fs::path home = fs::current_path();
-  fs::current_path(Scratch());
+  fs::current_path(kScratch);
   std::array<std::string, kDataFiles> data;
   for (std::size_t i = 0; i < kDataFiles; ++i) {
     // Large enough for a file to take more than one read and reach the
@@ -117,8 +113,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* input, std::size_t siz
   if (manifest.find('/') == std::string::npos) {
     test::WriteFile(kManifestPath, manifest);
     std::remove(kDigestFilePath);
-    const Outcome hashed = Run(1, Hash);
-    Require(hashed[0] == "0" && Run(4, Hash) == hashed);
+    const Outcome hashed = Run(1, kHash);
+    Require(hashed[0] == "0" && Run(4, kHash) == hashed);
     std::string records = test::ReadFile(kDigestFilePath).value_or("");
     Require(!laidOut || records == model);
     // Damage: one byte changed, or the file cut short.

@@ -46,31 +46,24 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   test::Require(!regenerated || KeyManage(KMM_OPTION_REGENERATE, 0) != nullptr);
   const bool altered = in.remaining_bytes() > 0;
   while (in.remaining_bytes() > 0) {
-    switch (in.ConsumeIntegralInRange(0, 4)) {
-      case 0: {
-        const char* path = files[in.ConsumeIntegralInRange(0, 3)];
-        in.ConsumeBool() ? (void)std::remove(path)
-                         : test::WriteFile(path, in.ConsumeRandomLengthString(400));
-        break;
-      }
-      case 1: {
-        const auto offset = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize - 1);
-        const std::string bytes = in.ConsumeRandomLengthString(eeprom::kSize - offset);
-        std::memcpy(eeprom.image.data() + offset, bytes.data(), bytes.size());
-        break;
-      }
-      case 2:
-        eeprom.fault = {in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
-                        in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
-                        in.ConsumeIntegralInRange(0, 4)};
-        break;
-      case 3:
-        keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0u, 3u);
-        break;
-      default:
-        keyManager.keys[test::KeyAuth(test::ReadFile(kKeyIdPath).value_or(""))] =
-            test::KeyAuth(test::ReadFile(kKeyPwdPath).value_or(""));
-        break;
+    const int step = in.ConsumeIntegralInRange(0, 4);
+    if (step == 0) {
+      const char* path = files[in.ConsumeIntegralInRange(0, 3)];
+      in.ConsumeBool() ? (void)std::remove(path)
+                       : test::WriteFile(path, in.ConsumeRandomLengthString(400));
+    } else if (step == 1) {
+      const auto offset = in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize - 1);
+      const std::string bytes = in.ConsumeRandomLengthString(eeprom::kSize - offset);
+      std::memcpy(eeprom.image.data() + offset, bytes.data(), bytes.size());
+    } else if (step == 2) {
+      eeprom.fault = {in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
+                      in.ConsumeIntegralInRange<std::uint32_t>(0, eeprom::kSize),
+                      in.ConsumeIntegralInRange(0, 4)};
+    } else if (step == 3) {
+      keyManager.fail[in.ConsumeIntegralInRange(0, 3)] = in.ConsumeIntegralInRange(0u, 3u);
+    } else {
+      keyManager.keys[test::KeyAuth(test::ReadFile(kKeyIdPath).value_or(""))] =
+          test::KeyAuth(test::ReadFile(kKeyPwdPath).value_or(""));
     }
   }
   const KeyContext* context = KeyManage(KMM_OPTION_NORMAL_BOOT, 1);

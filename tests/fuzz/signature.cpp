@@ -7,6 +7,7 @@
 
 #include "integrity/signature.h"
 #include "support/files.h"
+#include "util/hex.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   namespace integrity = keymgr::integrity;
@@ -19,10 +20,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   // The key of tests/cli/data/digest_key.pem, whose seed file signs nothing
   // that anyone could make of these bytes.
-  constexpr integrity::PublicKey kKey = {0xbf, 0x69, 0x3f, 0xab, 0xaf, 0x26, 0xf0, 0x11,
-                                         0xde, 0xd9, 0xd4, 0x01, 0xae, 0xf6, 0x99, 0x16,
-                                         0x0c, 0x4a, 0xe4, 0xb3, 0x84, 0x64, 0x76, 0xca,
-                                         0x45, 0xbd, 0x19, 0x9a, 0xe8, 0x6c, 0xa0, 0x58};
+  constexpr integrity::PublicKey kKey =
+      *keymgr::HexBytes<32>("bf693fabaf26f011ded9d401aef699160c4ae4b3846476ca45bd199ae86ca058");
   std::uint64_t counter = 0;
   Require(!integrity::CheckSignatureFile({data, size}, kKey, {}, {}, &counter).ok());
   return 0;

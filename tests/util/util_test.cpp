@@ -3,6 +3,7 @@
 #include <array>
 #include <numeric>
 #include <string>
+#include <tuple>
 
 #include "support/sandbox.h"
 #include "util/bytes.h"
@@ -34,14 +35,9 @@ TEST(BytesTest, PrintersAndHex) {
   char dst[256] = "Q";
   const std::string kNull = "ERR: Null pointer detecter or zero length\n";
   const std::string kShort = "ERR: to short destination buffer";
-  const struct {
-    const std::uint8_t* src;
-    int n;
-    char* to;
-    int size;
-    const std::string& out;
-  } fails[] = {{nullptr, 2, dst, 5, kNull}, {b, 0, dst, 5, kNull},  {b, 2, nullptr, 5, kNull},
-               {b, 2, dst, 0, kNull},       {b, 2, dst, 4, kShort}, {b, 128, dst, 255, kShort}};
+  const std::tuple<const std::uint8_t*, int, char*, int, std::string> fails[] = {
+      {nullptr, 2, dst, 5, kNull}, {b, 0, dst, 5, kNull},  {b, 2, nullptr, 5, kNull},
+      {b, 2, dst, 0, kNull},       {b, 2, dst, 4, kShort}, {b, 128, dst, 255, kShort}};
   for (const auto& [src, n, to, size, out] : fails) {
     EXPECT_EQ(Output([&] { EXPECT_EQ(BytesToHex(src, n, to, size), -1); }), out) << n << size;
     EXPECT_STREQ(dst, "Q");
@@ -54,11 +50,10 @@ TEST(BytesTest, PrintersAndHex) {
 // Hex text decodes two digits a byte, of either case, and nothing else; big-
 // endian integers store and load back, most significant byte first.
 TEST(BytesTest, HexAndEndian) {
-  std::array<std::uint8_t, 2> two{};
-  EXPECT_TRUE(keymgr::HexDecode("0aF9", two));
-  EXPECT_EQ(two, (std::array<std::uint8_t, 2>{0x0A, 0xF9}));
+  constexpr std::array<std::uint8_t, 2> two = {0x0A, 0xF9};
+  EXPECT_EQ(keymgr::HexBytes<2>("0aF9"), two);
   for (const char* bad : {"0aF", "0aF9b", "0aF ", "+aF9", "0xF9", "0g00", ""}) {
-    EXPECT_FALSE(keymgr::HexDecode(bad, two)) << bad;
+    EXPECT_FALSE(keymgr::HexBytes<2>(bad)) << bad;
   }
   EXPECT_STREQ(keymgr::HexText(two, keymgr::HexCase::kLower).data(), "0af9");
   std::array<std::uint8_t, 8> b{};
