@@ -5,7 +5,6 @@
 // with the digest of the image the firmware started.
 #include <gtest/gtest.h>
 #include <kmm/kmm.h>
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -105,28 +104,6 @@ struct Interposer {
   TpmProxy proxy;
 };
 
-// KillTpm kills the suite's swtpm as a power cut would, and starts it again
-// on the state it left.
-void KillTpm() {
-  const fs::path run = fs::path(kSwtpm).parent_path();
-  const pid_t pid = std::stoi(*ReadFile(run / "swtpm.pid"));
-  ASSERT_EQ(::kill(pid, SIGKILL), 0);
-  while (::kill(pid, 0) == 0) {
-    ::usleep(10000);
-  }
-  fs::remove(kSwtpm);
-  fs::remove(kSwtpm + ".ctrl");
-  ASSERT_EQ(Run({"swtpm", "socket", "--tpm2", "--server", "type=unixio,path=" + kSwtpm, "--ctrl",
-                 "type=unixio,path=" + kSwtpm + ".ctrl", "--tpmstate",
-                 "dir=" + (run / "swtpm-state").string(), "--flags", "not-need-init,startup-clear",
-                 "--pid", "file=" + (run / "swtpm.pid").string(), "--daemon"})
-                .status,
-            0);
-  for (int i = 0; i < 100 && Tpm2({"tpm2_getcap", "properties-fixed"}).status != 0; ++i) {
-    ::usleep(50000);
-  }
-}
-
 // Proved runs the module's boot proof and gives its one-off key, or "" when
 // the proof failed.
 std::string Proved() {
@@ -212,11 +189,6 @@ void KeymgrSkippedAndTheGoodValueExtendedByHand(Chain& /*chain*/) {
   EXPECT_EQ(Proved(), "");
 }
 
-void AChangedKernel(Chain& /*chain*/) {
-  EXPECT_EQ(Chain::Boot("A with another kernel").status, 0);
-  EXPECT_EQ(Proved(), "");
-}
-
 void ASecondProofInTheSameBoot(Chain& /*chain*/) {
   ASSERT_EQ(Chain::Boot("A").status, 0);
   EXPECT_NE(Proved(), "");
@@ -258,15 +230,13 @@ void BootsRelease(std::uint64_t n, const std::string& image) {
   EXPECT_EQ(Floor(), n);
 }
 
-void ANewReleaseWithANewPolicyNeedsNoReseal(Chain& chain) {
-  BootsRelease(chain.base_ + 1, "B");
-}
-
-// Release 5 good, 6 good, 5 again refused, 7 good.
+// Release 5 good, 6 good, 5 again refused, 7 good; release 6, with a boot
+// image of its own and the vendor's policy for it, proves the key made
+// under release 5's without a reseal.
 void AnOlderReleasePutBack(Chain& chain) {
   ASSERT_EQ(Chain::Boot("A").status, 0);
   EXPECT_EQ(Floor(), chain.base_);
-  BootsRelease(chain.base_ + 1, "A");
+  BootsRelease(chain.base_ + 1, "B");
   Restore(chain.first_);
   const RunResult old = Chain::Boot("A");
   EXPECT_EQ(old.status, 1);
@@ -279,38 +249,28 @@ void AnOlderReleasePutBack(Chain& chain) {
   BootsRelease(chain.base_ + 2, "A");
 }
 
-// A boot cut short at each command of the counter's move (the bus hung up,
-// the swtpm killed and started again on its state), then a good boot: the
-// move is completed.
+// A boot of the next release cut short at each command (the bus hung up
+// there, then the power cycled), the counter's move among them, then a good
+// boot: the move is completed.
 void APowerCutInTheCountersMove(Chain& chain) {
   ASSERT_EQ(Chain::Boot("A").status, 0);
-  Release(chain.base_ + 1, "A");
-  std::vector<TpmProxy::Command> sent;
-  {
-    Interposer bus;
-    PowerOn("A");
-    bus.proxy.Arm(TpmProxy::Fault::kNone, 0);
-    ASSERT_EQ(Run({S}).status, 0);
-    sent = bus.proxy.Sent();
-  }
-  // The move follows the verdict's extend.
-  std::size_t first = 0;
-  while (first < sent.size() && sent[first].code != 0x182) {
-    ++first;
-  }
-  // Each cut is back at the previous release, its counter not yet moved.
-  for (std::size_t cut = first + 2; cut <= sent.size(); ++cut) {
+  for (int cut = 1;; ++cut) {
     SCOPED_TRACE("cut at command " + std::to_string(cut));
+    Release(chain.base_ + cut, "A");
+    bool reached = false;
     {
       Interposer bus;
       PowerOn("A");
-      bus.proxy.Arm(TpmProxy::Fault::kHangUp, static_cast<int>(cut));
+      bus.proxy.Arm(TpmProxy::Fault::kHangUp, cut);
       Run({S});
+      reached = static_cast<int>(bus.proxy.Sent().size()) >= cut;
     }
-    KillTpm();
     ASSERT_EQ(Chain::Boot("A").status, 0);
-    EXPECT_EQ(Floor(), chain.base_ + 1);
+    EXPECT_EQ(Floor(), chain.base_ + cut);
     EXPECT_NE(Proved(), "");
+    if (!reached) {
+      break;
+    }
   }
 }
 
@@ -396,11 +356,9 @@ const Row kRows[] = {
     {"the FAIL extend rewritten to the good one on the bus", FailRewrittenToGoodOnTheBus},
     {"keymgr skipped and the good value extended by hand",
      KeymgrSkippedAndTheGoodValueExtendedByHand},
-    {"a changed kernel", AChangedKernel},
     {"a second proof in the same boot", ASecondProofInTheSameBoot},
     {"a TPM resumed after a proof", ATpmResumedAfterAProof},
     {"the TPM unreachable at the boot run", TheTpmUnreachableAtTheBootRun},
-    {"a new release with a new policy needs no reseal", ANewReleaseWithANewPolicyNeedsNoReseal},
     {"an older release put back", AnOlderReleasePutBack},
     {"a power cut in the counter's move", APowerCutInTheCountersMove},
     {"the counter moved without a good verdict", TheCounterMovedWithoutAGoodVerdict},
