@@ -1,8 +1,9 @@
-// The chain of trust of a sealed build on the suite's swtpm, as an attacker
-// with the disk, the TPM bus and root after boot tries it: keymgr-sealed
-// (signed, measuring into PCR 14) and the module with its key sealed under
-// the test vendor key, each boot's boot chain standing in as PCR 4 extended
-// with the digest of the image the firmware started.
+// The verdict measured into PCR 14 on the suite's swtpm. The chain of trust
+// of a sealed build, as an attacker with the disk, the TPM bus and root after
+// boot tries it: keymgr-sealed (signed, measuring into PCR 14) and the module
+// with its key sealed under the test vendor key, each boot's boot chain
+// standing in as PCR 4 extended with the digest of the image the firmware
+// started. And keymgr-measured, which measures without signed files.
 #include <gtest/gtest.h>
 #include <kmm/kmm.h>
 #include <sys/stat.h>
@@ -12,8 +13,8 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
-#include <memory>
 
+#include "eeprom/eeprom_map.h"
 #include "keymgr_build_config.h"
 #include "policy/file.h"
 #include "support/sandbox.h"
@@ -368,6 +369,86 @@ const Row kRows[] = {
     {"the signed build closes the PCR itself", TheSignedBuildClosesThePcrItself},
 };
 INSTANTIATE_TEST_SUITE_P(Rows, ChainRows, testing::ValuesIn(kRows), RowName());
+
+// keymgr-measured, a build that measures without signed files.
+
+const std::string M = KEYMGR_TEST_MEASURED_BIN, K = KEYMGR_TEST_KEYMGR_BIN;
+const std::string kB = InRoot("/d/b");
+const std::string kImage = KEYMGR_EEPROM_PATH;
+
+// The PCR value of a PCR reset to zeros and extended with |verdict|'s event.
+std::string PcrAfter(const std::string& verdict) {
+  std::string pcr = Hex(Sha256(std::string(32, '\0') + Sha256("keymgr boot verdict: " + verdict)));
+  std::erase(pcr, ' ');
+  return verdict.empty() ? std::string(64, '0') : pcr;
+}
+
+// PCR 14 as tpm2-tools print it (upper case).
+std::string Pcr() {
+  const std::string out = Tpm2({"tpm2_pcrread", "sha256:14"}).out;
+  return out.substr(out.find("0x") + 2, 64);
+}
+
+bool Replays(const std::string& value) {
+  return test::Run({KEYMGR_TEST_EVENTLOG_BIN, kEvents, "--pcr", "14", "--expect", value}).status ==
+         0;
+}
+
+// Each test starts from a device with its digest file made, the TPM
+// power-cycled (PCRs reset) as a reboot does.
+class Measured : public testing::Test {
+ protected:
+  void SetUp() override {
+    ResetDevice(0x42, 0);
+    WriteFile(kA, "");
+    WriteFile(kB, "b");
+    WriteFile(kManifestPath, kA + " " + kB);
+    test::Run({K, "hash"});
+    PowerCycleTpm();
+  }
+  const TpmClean clean_;
+};
+
+// keymgr-measured extends PCR 14 with one event, whose digest is its
+// verdict's alone, and writes an event log that replays to the PCR; a run
+// without a TPM keeps its BN line, fails, and leaves the log empty: a boot
+// that could not measure goes no further.
+struct MeasuredRow {
+  const char* name;
+  void (*change)();
+  const std::string* away;  // a file moved aside for the run
+  int status;
+  std::string line, verdict;  // a line of the output; "" for no event
+};
+class MeasuredRows : public Measured, public testing::WithParamInterface<MeasuredRow> {};
+TEST_P(MeasuredRows, VerdictIsMeasuredAndReplays) {
+  const MeasuredRow& row = GetParam();
+  row.change();
+  if (row.away != nullptr) {
+    std::filesystem::rename(*row.away, *row.away + ".away");
+  }
+  const RunResult run = test::Run({M});
+  if (row.away != nullptr) {
+    std::filesystem::rename(*row.away + ".away", *row.away);
+  }
+  EXPECT_EQ(run.status, row.status);
+  EXPECT_NE(run.out.find(row.line), std::string::npos) << run.out;
+  EXPECT_EQ(Pcr(), PcrAfter(row.verdict));
+  EXPECT_EQ(Replays(Pcr()), !row.verdict.empty());
+  EXPECT_EQ(ReadFile(kEvents)->find("\"verdict\":\"" + row.verdict + "\"") != std::string::npos,
+            !row.verdict.empty());
+}
+const MeasuredRow kMeasuredRows[] = {
+    // clang-format off
+    {"a good boot", [] {}, nullptr, 0, "BN=OK\n", "BN=OK"},
+    {"a file altered", [] { WriteFile(kB, "x"); }, nullptr, 0, "BN=FAIL\n", "BN=FAIL"},
+    {"no digest file", [] { std::filesystem::remove(kDigestFilePath); }, nullptr, 1, "BN=FAIL\n", "BN=FAIL"},
+    {"the gate closed", [] { WriteFile(kImage, ReadFile(kImage)->replace(eeprom::kControlByteOffset, 1, 1, '\0')); }, nullptr, 0, "SFE_003 - [0]\n", "none"},
+    {"no EEPROM", [] {}, &kImage, 0, "Read Error [-2]", "none"},
+    {"no TPM", [] {}, &kSwtpm, 1, "BN=OK\n", ""},
+    // clang-format on
+};
+INSTANTIATE_TEST_SUITE_P(Rows, MeasuredRows, testing::ValuesIn(kMeasuredRows), RowName());
 
 }  // namespace
 }  // namespace keymgr::test
