@@ -4,7 +4,6 @@
 // error code, hang up on it, or change its bytes on the way.
 #pragma once
 
-#include <atomic>
 #include <cstdint>
 #include <cstdio>
 #include <mutex>

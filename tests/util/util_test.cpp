@@ -7,7 +7,6 @@
 
 #include "support/sandbox.h"
 #include "util/bytes.h"
-#include "util/endian.h"
 #include "util/hex.h"
 
 namespace {
@@ -47,23 +46,16 @@ TEST(BytesTest, PrintersAndHex) {
   EXPECT_EQ(std::string(dst, 4) + std::string(dst + 250, 6), std::string("8081FDFE\0Q", 10));
 }
 
-// Hex text decodes two digits a byte, of either case, and nothing else; big-
-// endian integers store and load back, most significant byte first.
-TEST(BytesTest, HexAndEndian) {
+// Hex text decodes two digits a byte, of either case, and nothing else.
+// (The big-endian helpers, one template, carry the size of every TPM
+// response and the numbers of keymgr.sig and the policy file.)
+TEST(BytesTest, Hex) {
   constexpr std::array<std::uint8_t, 2> two = {0x0A, 0xF9};
   EXPECT_EQ(keymgr::HexBytes<2>("0aF9"), two);
   for (const char* bad : {"0aF", "0aF9b", "0aF ", "+aF9", "0xF9", "0g00", ""}) {
     EXPECT_FALSE(keymgr::HexBytes<2>(bad)) << bad;
   }
   EXPECT_STREQ(keymgr::HexText(two, keymgr::HexCase::kLower).data(), "0af9");
-  std::array<std::uint8_t, 8> b{};
-  keymgr::StoreBig64(b.data(), 0x0102030405060708u);
-  EXPECT_EQ(b, (std::array<std::uint8_t, 8>{1, 2, 3, 4, 5, 6, 7, 8}));
-  EXPECT_EQ(keymgr::LoadBig16(b.data() + 6), 0x0708u);
-  keymgr::StoreBig32(b.data(), 0xFFFEFDFCu);
-  keymgr::StoreBig16(b.data() + 4, 0x8000u);
-  EXPECT_EQ(keymgr::LoadBig64(b.data()), 0xFFFEFDFC80000708u);
-  EXPECT_EQ(keymgr::LoadBig32(b.data() + 2), 0xFDFC8000u);
 }
 
 }  // namespace
