@@ -44,7 +44,11 @@ TEST(Eeprom, CallsReturnTheBytesMovedOrTheNegativeErrno) {
       {ReadEEPROM(1, 0, 1, buffer), -ENODEV},
       {WriteSectionEEPROM(kDevice, 10, 4, buffer, 8, 5), -ERANGE},
       {WriteSectionEEPROM(kDevice, 10, 4, "abcd", 8, 6), 4},
+      {WriteSectionEEPROM(kDevice, 10, 4, "abcd", 11, 6), -ERANGE},
       {Write(32767, "ab"), -ERANGE},
+      {Write(0xFFFFFFFF, "ab"), -ERANGE},
+      {ReadEEPROM(kDevice, 0, 2, nullptr), -EINVAL},
+      {ReadEEPROM(kDevice, 32768, 0, nullptr), 0},
   };
   for (std::size_t i = 0; i < std::size(calls); ++i) {
     EXPECT_EQ(calls[i].first, calls[i].second) << "call " << i;
