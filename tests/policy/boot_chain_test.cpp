@@ -4,9 +4,9 @@
 // certificate table at its end (as a signed kernel carries one), then
 //   aarch64-linux-gnu-objcopy --add-section .osrel=... --add-section
 //     .cmdline=... --add-section .linux=kernel.efi (each at its own VMA)
-// PCR 4 below is the firmware prototype's, computed independently of
-// this code: scripts/vm-firmware/predict-pcrs.py predict data/uki.efi prints
-// it.
+// PCR 4 below was computed independently of this code, by a prediction
+// written apart from it; the VM test holds the same prediction against what
+// U-Boot measures.
 #include <gtest/gtest.h>
 
 #include <algorithm>
