@@ -4,9 +4,9 @@
 
 #include <gtest/gtest.h>
 
-#include <cctype>
 #include <cstdint>
 #include <functional>
+#include <regex>
 #include <set>
 #include <string>
 #include <string_view>
@@ -87,15 +87,7 @@ struct TpmClean {
 struct RowName {
   template <class Row>
   std::string operator()(const testing::TestParamInfo<Row>& info) const {
-    std::string id;
-    for (const char c : std::string_view(info.param.name)) {
-      if (std::isalnum(static_cast<unsigned char>(c)) != 0) {
-        id += c;
-      } else if (!id.empty() && id.back() != '_') {
-        id += '_';
-      }
-    }
-    return id;
+    return std::regex_replace(std::string(info.param.name), std::regex("[^A-Za-z0-9]+"), "_");
   }
 };
 
