@@ -175,13 +175,4 @@ const Case kCases[] = {
 };
 INSTANTIATE_TEST_SUITE_P(Rows, Commands, testing::ValuesIn(kCases), t::RowName());
 
-// keymgr hash replaces the digest file durably: synced, renamed into place,
-// its folder synced.
-TEST(KeymgrTest, HashReplacesTheDigestFileDurably) {
-  t::ResetDevice(0x42, 0);
-  t::WriteFile(a, "a");
-  t::WriteFile(kManifest, a);
-  EXPECT_EQ(t::SyncTrace({K, "hash"}), "F L R:keymgr.cb D ");
-}
-
 }  // namespace

@@ -38,7 +38,8 @@ class KmmHostE2e : public testing::Test {
 };
 
 // Regenerated under umask 000, the key material is private, each file synced,
-// renamed into place and its folder synced, in order. A boot proves it; with
+// renamed into place and its folder synced, in order, as keymgr hash replaces
+// the digest file. A boot proves it; with
 // a password that the TPM refuses it fails, and on request the failing TPM
 // call is named on standard error, once, standard output staying as it is.
 // (The tamperings, a link planted at a key file among them, are the hostile
@@ -46,6 +47,8 @@ class KmmHostE2e : public testing::Test {
 TEST_F(KmmHostE2e, RegenerationIsProvedAtBootAndAWrongPasswordFails) {
   EXPECT_EQ(SyncTrace({"sh", "-c", "umask 0 && exec \"$@\"", "sh", H, "3"}),
             "F L R:keymgr.cs D F L R:keymgr.hddkeyid D F L R:keymgr.hddpwd D F L R:keymgr.ook D ");
+  WriteFile(kManifestPath, kKeyIdPath);
+  EXPECT_EQ(SyncTrace({K, "hash"}), "F L R:keymgr.cb D ");
   for (const char* path : {kKeyIdPath, kKeyPwdPath, kStoredOokPath, kScDigestPath}) {
     struct stat st {};
     ASSERT_EQ(lstat(path, &st), 0) << path;

@@ -20,6 +20,7 @@
 #include "support/tpm_bus.h"
 #include "support/tpm_settings.h"
 #include "tpm/chain.h"
+#include "util/endian.h"
 #include "util/hex.h"
 #include "util/paths.h"
 #include "verdict/verdict.h"
@@ -48,7 +49,7 @@ void PowerOn(const std::string& image) {
 
 // Release lays out release |n| for the boot image |image|: a listed file,
 // the signed digest file, and the vendor's policy for that image's PCR 4.
-// It gives back the files, to put an old release back with Restore.
+// It gives back the files, to put an old release back.
 using Files = std::map<std::string, std::string>;
 Files Release(std::uint64_t n, const std::string& image) {
   WriteFile(kA, "release " + std::to_string(n));
@@ -72,21 +73,12 @@ Files Release(std::uint64_t n, const std::string& image) {
   return files;
 }
 
-void Restore(const Files& files) {
-  for (const auto& [path, bytes] : files) {
-    WriteFile(path, bytes);
-  }
-}
-
 // Floor is the release counter at |handle| (by default sealed builds'), 0
 // while it was never moved.
 std::uint64_t Floor(const std::string& handle = "0x01800B0F") {
   const RunResult read = Tpm2({"tpm2_nvread", handle, "-s", "8"});
-  std::uint64_t floor = 0;
-  for (std::size_t i = 0; read.status == 0 && i < 8 && i < read.out.size(); ++i) {
-    floor = floor << 8 | static_cast<std::uint8_t>(read.out[i]);
-  }
-  return floor;
+  const auto* bytes = reinterpret_cast<const std::uint8_t*>(read.out.data());
+  return read.status == 0 && read.out.size() == 8 ? LoadBig64(bytes) : 0;
 }
 
 // Away makes the suite's swtpm unreachable while it lives.
@@ -237,7 +229,9 @@ void AnOlderReleasePutBack(Chain& chain) {
   ASSERT_EQ(Chain::Boot("A").status, 0);
   EXPECT_EQ(Floor(), chain.base_);
   BootsRelease(chain.base_ + 1, "B");
-  Restore(chain.first_);
+  for (const auto& [path, bytes] : chain.first_) {
+    WriteFile(path, bytes);
+  }
   const RunResult old = Chain::Boot("A");
   EXPECT_EQ(old.status, 1);
   EXPECT_NE(old.out.find("release counter: " + std::to_string(chain.base_) +
