@@ -39,9 +39,9 @@ class KmmHostE2e : public testing::Test {
 
 // Regenerated under umask 000, the key material is private, each file synced,
 // renamed into place and its folder synced, in order, as keymgr hash replaces
-// the digest file. A boot proves it; with
-// a password that the TPM refuses it fails, and on request the failing TPM
-// call is named on standard error, once, standard output staying as it is.
+// the digest file. A boot proves it; with a password that the TPM refuses it
+// fails, and on request the failing TPM call is named on standard error,
+// once, standard output staying as it is.
 // (The tamperings, a link planted at a key file among them, are the hostile
 // files' rows; the log lines, the flow tests'.)
 TEST_F(KmmHostE2e, RegenerationIsProvedAtBootAndAWrongPasswordFails) {
