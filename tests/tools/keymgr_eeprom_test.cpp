@@ -9,9 +9,10 @@
 namespace keymgr::test {
 namespace {
 
-// Tool runs keymgr-eeprom with |words| split as a command line is.
+// Tool runs keymgr-eeprom with |words| split as a command line is (behind
+// the emulator of a cross build, which Run puts before the program).
 RunResult Tool(const std::string& words) {
-  return Run({"sh", "-c", "exec timeout 10 \"$0\" " + words, KEYMGR_TEST_EEPROM_BIN});
+  return Run({"sh", "-c", "exec \"$@\" " + words, "sh", "timeout", "10", KEYMGR_TEST_EEPROM_BIN});
 }
 
 // Numbers are decimal (a leading zero does not make octal) or 0x-prefixed hex.
